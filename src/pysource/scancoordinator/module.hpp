@@ -1,0 +1,86 @@
+// Module-wide state of pysource.scancoordinator: records, constants, the
+// module's types, and small helpers shared by the queue and coordinator units.
+//
+// The module is initialised once per process (see module.cpp), so this state
+// is process-wide and deliberately never freed.
+#pragma once
+
+#include "host/pyref.hpp"
+
+#include <cstdint>
+
+namespace scancoord {
+
+constexpr long long kTypingModulePriority = 0;
+constexpr long long kInteractivePriority = 1;
+constexpr long long kBackgroundPriority = 2;
+constexpr long long kMaxWholeFilesPerCheck = 25;
+constexpr double kMinRescanInterval = 5.0;
+
+struct State {
+  py::Ref module;                  // the one module object of this process
+  py::Ref CScanItem;               // collections.namedtuple record types
+  py::Ref CSingleQueueStatus;
+  py::Ref CScanStatus;
+  py::Ref defaultdict;             // collections.defaultdict
+  py::Ref int_type;                // int, the defaultdict factory
+  py::Ref kWildcardScope;          // symbolinfo.kWildcardScope ('*')
+  py::Ref empty_item;              // CScanItem(None, None, None, None)
+  py::Ref priorities[3];           // the three published priority ints
+  PyTypeObject *SingleQueueType = nullptr;
+  PyTypeObject *ScanQueueType = nullptr;
+  PyTypeObject *CoordinatorType = nullptr;
+  // Invariant checks and debug-only diagnostics run unless Python was
+  // started with -O, exactly as `assert` statements would.
+  bool debug = true;
+};
+
+extern State *state;
+
+// A CScanItem built directly (namedtuples are tuple subclasses whose
+// __new__ only packs its arguments), without calling through Python.
+py::Ref make_scan_item(py::Borrowed loc, py::Borrowed scope, py::Borrowed scan_name,
+                       py::Borrowed priority);
+
+// Field access on any CScanItem-like object: a tuple subclass is read by
+// index (its fields are positional), anything else by attribute name.
+py::Ref item_field(py::Borrowed item, int index);
+
+// Raise AssertionError (with an optional message), as a failed `assert`.
+[[noreturn]] void assertion_failed(const char *msg = nullptr);
+
+// Message texts of this module, in one place.
+namespace msg {
+constexpr const char *kExpectedType = "Expected %s, got %.200s";
+constexpr const char *kArgCount = "%.200s() takes %.8s %zd positional argument%.1s (%zd given)";
+constexpr const char *kUnexpectedKeyword = "%s() got an unexpected keyword argument '%U'";
+constexpr const char *kDuplicateKeyword = "%s() got multiple values for keyword argument '%U'";
+constexpr const char *kTooManyValues = "too many values to unpack (expected %zd)";
+constexpr const char *kNotEnoughValues = "not enough values to unpack (expected %zd, got %zd)";
+constexpr const char *kNotReached = "should not be reached";
+constexpr const char *kScanWithoutOrder = "Scan without order: ";
+constexpr const char *kReinit =
+    "Module 'scancoordinator' has already been imported. Re-initialisation is not supported.";
+constexpr const char *kInterpreterChange = "Interpreter change detected - this module can only be "
+                                           "loaded into one interpreter per process.";
+} // namespace msg
+
+// Argument parsing for METH_FASTCALL | METH_KEYWORDS methods.  `names` has
+// `total` entries, the first `required` of which are mandatory; `out` receives
+// borrowed references (nullptr for an omitted optional argument).  Raises the
+// interpreter's usual TypeErrors.
+void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames,
+                const char *const *names, int required, int total, PyObject **out);
+
+// Unpack a 2- or 3-item sequence the way Python's tuple unpacking does
+// (tuples and lists fast, any iterable otherwise).
+void unpack(py::Borrowed seq, Py_ssize_t n, py::Ref *out);
+// Unpack a value that must be exactly a tuple (TypeError "Expected tuple,
+// got X" otherwise).
+void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out);
+
+// A signed 64-bit machine integer from a Python object (TypeError for
+// non-integers, OverflowError when it does not fit).
+long long as_int64(py::Borrowed o);
+
+} // namespace scancoord

@@ -1,0 +1,103 @@
+// _CScanQueue internals shared by its units (structure and adding/removing,
+// retrieval and queries, waiting and deferred signals, the Python face).
+//
+// The queue keeps every pending scan (location, scope name, scan name) at an
+// integer priority.  Invariants kept by every operation:
+//  1. A ready scan queued at priority p is recorded in three places at once:
+//     its scope name is in the name list of its location in the single queue
+//     for (p, order of its scan name); (scope, scan name) -> p is in the
+//     location's pending dictionary; and it is counted in the location's
+//     per-name counts and in _fPerScanNameCounts.  One priority per scan.
+//  2. A name list holding '*' holds nothing else; name lists are sorted,
+//     distinct and never empty while stored.
+//  3. A location parked for inspection has no ready scans: all of its scans
+//     leave the single queues and _fPerLocationInfo together, and return
+//     together.
+// The fields are real Python containers, readable from Python.  Operations
+// that call out to Python (a location's __hash__/__eq__, host functions,
+// signal handlers) hold strong references to every container they are
+// walking, so a re-entrant change can at worst be seen, never crash us.
+#pragma once
+
+#include "pysource/scancoordinator/module.hpp"
+#include "pysource/scancoordinator/types.hpp"
+
+#include <utility>
+#include <vector>
+
+namespace scancoord::sq {
+
+using Q = ScanQueueObject;
+using py::Borrowed;
+using py::Ref;
+
+// ---- structure, adding and removing --------------------------------------
+void init(Q *q, Borrowed location_data_cache);
+void SetScansToOrder(Q *q, Borrowed scans_to_order);
+Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority);
+// The priority the scan is queued at, or an empty Ref for None.  `key` is
+// the (scope, scan name) tuple when the caller already has it.
+Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed key);
+void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
+                  bool add_to_check);
+using PairList = std::vector<std::pair<Ref, Ref>>;
+void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
+                       bool add_to_check);
+void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
+                             Borrowed priority, Borrowed key);
+bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
+                                  Borrowed priority, Borrowed key);
+bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                      bool remove_waiting, Borrowed key);
+void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting);
+void Clear(Q *q);
+void ScanCompleted(Q *q, Borrowed scan_item);
+void destroy_impl(Q *q);
+
+// ---- retrieval and queries -----------------------------------------------
+Ref First(Q *q);
+Ref FirstOrNone(Q *q); // empty Ref for None
+Ref PopWholeFilesToCheck(Q *q, Py_ssize_t max_files);
+Ref GetPendingDictForLoc(Q *q, Borrowed loc); // empty Ref for None
+bool LocationInQueue(Q *q, Borrowed loc, Borrowed scan_name);
+bool Empty(Q *q, bool include_waiting);
+Py_ssize_t GetFileCount(Q *q, Borrowed scan_name, Borrowed priority);
+Ref GetScanCount(Q *q, Borrowed scan_item);
+Py_ssize_t GetWaitingCount(Q *q);
+void UpdateForVisibleDocuments(Q *q, Borrowed active_loc, Borrowed visible_locs);
+void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed from_queue,
+                            Borrowed to_queue);
+void CB_SingletonChanged(Q *q);
+void CB_ActiveDocChanged(Q *q);
+void PrintScanQueues(Q *q, Borrowed write, Py_ssize_t limit);
+
+// ---- waiting for inspection / data, deferred signals ---------------------
+bool IsTreeBranchReady(Q *q, Borrowed loc);
+void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_priority);
+void AddItemsWaitingForInspect(Q *q, Borrowed loc, Borrowed item_seq);
+void SetWholeFileCheckWaitingForInspect(Q *q, Borrowed loc, Borrowed check_priority);
+void CB_TreeBranchesNowReady(Q *q, Borrowed data, Borrowed ready_set);
+void StartWaitingForData(Q *q, Borrowed scan_item);
+void FinishedWaitingForData(Q *q, Borrowed scan_item);
+void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set);
+// _UpdatePendingSets({loc}, None) or (None, {loc}) without building the set.
+void LocationAdded(Q *q, Borrowed loc);
+void LocationRemoved(Q *q, Borrowed loc);
+void SignalEmitIdle(Q *q);
+
+// ---- shared helpers ------------------------------------------------------
+// The (counts, pending) pair stored for a location; both empty if absent.
+struct LocInfo {
+  Ref tuple, counts, pending;
+  explicit operator bool() const { return bool(tuple); }
+};
+LocInfo loc_info(Q *q, Borrowed loc);
+// A name list as stored in a single queue (TypeError if not a list).
+PyListObject *as_name_list(Borrowed v);
+// bisect.bisect_left(list, x)
+Py_ssize_t bisect_left(Borrowed list, Borrowed x);
+Ref make_key(Borrowed scope, Borrowed scan_name);
+// A priority as stored: an int object of the given value.
+Ref priority_obj(long long p);
+
+} // namespace scancoord::sq

@@ -275,7 +275,7 @@ py::Ref make_scan_item(py::Borrowed loc, py::Borrowed scope, py::Borrowed scan_n
   PyObject *items[] = {loc.get(), scope.get(), scan_name.get(), priority.get()};
   for (int i = 0; i < 4; ++i)
     PyTuple_SET_ITEM(t, i, py::Ref::borrow(items[i]).release());
-  return py::Ref::steal(t);
+  return untrack_if_atomic(py::Ref::steal(t));
 }
 
 py::Ref item_field(py::Borrowed item, int index) {

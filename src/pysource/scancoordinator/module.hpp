@@ -42,6 +42,23 @@ extern State *state;
 py::Ref make_scan_item(py::Borrowed loc, py::Borrowed scope, py::Borrowed scan_name,
                        py::Borrowed priority);
 
+// Stop the cyclic GC from tracking a freshly built tuple whose items can never
+// take part in a cycle (strings, ints, None, untracked tuples).  The collector
+// applies the same rule lazily; doing it at creation keeps the queue's many
+// small key tuples out of every collection, and lets the dictionaries they
+// are stored in stay untracked too.
+inline py::Ref untrack_if_atomic(py::Ref t) {
+  const Py_ssize_t n = PyTuple_GET_SIZE(t.get());
+  for (Py_ssize_t i = 0; i < n; ++i) {
+    PyObject *item = PyTuple_GET_ITEM(t.get(), i);
+    if (PyObject_IS_GC(item) && PyObject_GC_IsTracked(item))
+      return t;
+  }
+  if (PyObject_GC_IsTracked(t.get()))
+    PyObject_GC_UnTrack(t.get());
+  return t;
+}
+
 // Field access on any CScanItem-like object: a tuple subclass is read by
 // index (its fields are positional), anything else by attribute name.
 py::Ref item_field(py::Borrowed item, int index);

@@ -23,7 +23,7 @@ namespace om = host::orderedmap;
 // ---- helpers -------------------------------------------------------------
 
 Ref make_key(Borrowed scope, Borrowed scan_name) {
-  return py::check(PyTuple_Pack(2, scope.get(), scan_name.get()));
+  return untrack_if_atomic(py::check(PyTuple_Pack(2, scope.get(), scan_name.get())));
 }
 
 Ref priority_obj(long long p) {
@@ -54,7 +54,7 @@ void read_count_pair(Borrowed pair, long long &scans, long long &locs) {
 
 Ref make_count_pair(long long scans, long long locs) {
   Ref a = py::integer(scans), b = py::integer(locs);
-  return py::check(PyTuple_Pack(2, a.get(), b.get()));
+  return untrack_if_atomic(py::check(PyTuple_Pack(2, a.get(), b.get())));
 }
 
 void write_scan_without_order(Borrowed scan_name) {
@@ -201,12 +201,10 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   return sq;
 }
 
-Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed key) {
-  LocInfo info = loc_info(q, loc);
-  if (info) {
-    Ref k = key ? key.ref() : make_key(scope, scan_name);
-    return py::dict_get(info.pending, k);
-  }
+namespace {
+// The waiting-for-inspection half of _FindScanPriority, for a location that
+// has no ready scans.
+Ref find_waiting_priority(Q *q, Borrowed loc) {
   if (PyDict_GET_SIZE(q->f._fWaitingForInspectByLoc.get()) == 0)
     return Ref();
   Ref entry = py::dict_get(q->f._fWaitingForInspectByLoc, loc);
@@ -216,7 +214,6 @@ Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bor
   unpack(entry, 2, parts);
   if (!parts[1].is_none())
     return parts[1];
-  Ref first;
   py::Ref it = py::check(PyObject_GetIter(parts[0].get()));
   Ref item = Ref::steal(PyIter_Next(it.get()));
   if (!item) {
@@ -228,8 +225,23 @@ Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bor
   }
   return item_field(item, 3);
 }
+} // namespace
+
+Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed key) {
+  LocInfo info = loc_info(q, loc);
+  if (info) {
+    Ref k = key ? key.ref() : make_key(scope, scan_name);
+    return py::dict_get(info.pending, k);
+  }
+  return find_waiting_priority(q, loc);
+}
 
 // ---- adding --------------------------------------------------------------
+
+namespace {
+void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
+                             Borrowed k, LocInfo &info);
+} // namespace
 
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check) {
@@ -294,11 +306,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     Ref key = make_key(scope, scan_name);
     LocInfo info = loc_info(q, loc);
     // 1. already queued?
-    Ref existing;
-    if (info)
-      existing = py::dict_get(info.pending, key);
-    else
-      existing = FindScanPriority(q, loc, scope, scan_name, key);
+    Ref existing = info ? py::dict_get(info.pending, key) : find_waiting_priority(q, loc);
     if (existing) {
       if (as_int64(existing) > p) {
         RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
@@ -312,8 +320,8 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     if (!scope_is_wild) {
       if (!wild_key)
         wild_key = make_key(wildcard, scan_name);
-      Ref whole = info ? py::dict_get(info.pending, wild_key)
-                       : FindScanPriority(q, loc, wildcard, scan_name, wild_key);
+      Ref whole =
+          info ? py::dict_get(info.pending, wild_key) : find_waiting_priority(q, loc);
       if (whole && as_int64(whole) <= p)
         continue;
     }
@@ -353,15 +361,17 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
       }
     }
     // 8. bookkeeping; 9. the whole-file check
-    AddScanToPerLocationMap(q, loc, scope, scan_name, prio, key);
+    add_to_per_location_map(q, loc, scan_name, prio, key, info);
     if (add_to_check)
       py::dict_set(whole_files, loc, prio);
   }
 }
 
-void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
-                             Borrowed priority, Borrowed key) {
-  LocInfo info = loc_info(q, loc);
+namespace {
+// _AddScanToPerLocationMap with the location's entry already looked up
+// (empty when it has none).
+void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
+                             Borrowed k, LocInfo &info) {
   if (!info) {
     info.counts = py::call(state->defaultdict, state->int_type);
     info.pending = py::new_dict();
@@ -369,7 +379,6 @@ void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_n
     py::dict_set(q->f._fPerLocationInfo, loc, info.tuple);
     LocationAdded(q, loc);
   }
-  Ref k = key ? key.ref() : make_key(scope, scan_name);
   if (state->debug && py::dict_contains(info.pending, k))
     assertion_failed();
   py::dict_set(info.pending, k, priority);
@@ -388,6 +397,14 @@ void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_n
   if (state->debug && scans < locs)
     assertion_failed();
   py::dict_set(q->f._fPerScanNameCounts, scan_name, make_count_pair(scans, locs));
+}
+} // namespace
+
+void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
+                             Borrowed priority, Borrowed key) {
+  LocInfo info = loc_info(q, loc);
+  Ref k = key ? key.ref() : make_key(scope, scan_name);
+  add_to_per_location_map(q, loc, scan_name, priority, k, info);
 }
 
 // ---- removing ------------------------------------------------------------

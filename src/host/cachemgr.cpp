@@ -1,0 +1,16 @@
+// The cache manager and its text buffers.
+#include "host/cachemgr.hpp"
+
+namespace host::cachemgr {
+
+py::Ref DoesCacheBufferExist(py::Borrowed cache_mgr, py::Borrowed loc) {
+  static py::Ref *n = new py::Ref(py::interned("DoesCacheBufferExist"));
+  return py::call_method(cache_mgr, *n, loc, py::Borrowed(Py_True));
+}
+
+void ClearEOLBlindCacheAndScans(py::Borrowed cache_mgr) {
+  static py::Ref *n = new py::Ref(py::interned("_ClearEOLBlindCacheAndScans"));
+  py::call_method(cache_mgr, *n);
+}
+
+} // namespace host::cachemgr

@@ -1,46 +1,414 @@
-// CScanCoordinator: the class object.
+// CScanCoordinator: the Python face (slots, fields as getset descriptors,
+// method table) and the dispatch of overridable operations.
 //
-// The coordinator derives from the host's CDestroyable like the queue
-// classes.  Its construction, lifecycle and scanning operations are not part
-// of this build yet: constructing one raises NotImplementedError rather than
-// returning an object that would silently do nothing.
-#include "pysource/scancoordinator/module.hpp"
-#include "pysource/scancoordinator/types.hpp"
+// Dispatch: on an instance of the class itself, an overridable operation is a
+// direct C++ call (no attribute lookup on the hot path).  On a subclass
+// instance the attribute is looked up; when it is our own built-in method
+// bound to this object the C++ code runs directly, otherwise the override is
+// called with the same arguments.  The module's own calls all go through
+// co::call, so an override sees every call the module makes.
+#include "pysource/scancoordinator/coordinator.hpp"
 #include "pysource/scancoordinator/typeutil.hpp"
-#include "host/objectmodel.hpp"
 
 namespace scancoord {
 
 namespace {
 
-struct Fields {
-  int visit(visitproc, void *) const { return 0; }
-  void clear() {}
-};
-struct Obj {
-  CDestroyableObject base;
-  Fields f;
-};
+using co::C;
 
-constexpr const char *kNotAvailable = "CScanCoordinator is not available in this build yet";
+C *coord(PyObject *self) { return reinterpret_cast<C *>(self); }
+C *ready(PyObject *self) {
+  C *c = coord(self);
+  if (!c->f._fScanQueue) {
+    PyErr_SetString(PyExc_RuntimeError, "CScanCoordinator.__init__() has not been called");
+    py::throw_error();
+  }
+  return c;
+}
+PyObject *none() { return py::Ref::none().release(); }
+PyObject *boolean(bool b) { return py::Ref::of_bool(b).release(); }
+py::Borrowed arg(PyObject *o) { return py::Borrowed(o); }
+bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt; }
 
-PyObject *tp_new(PyTypeObject *, PyObject *, PyObject *) {
-  PyErr_SetString(PyExc_NotImplementedError, kNotAvailable);
-  return nullptr;
+#define SC_METHOD(name)                                                                            \
+  PyObject *m_##name(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames)
+#define SC_ARGS(fname, required, ...)                                                              \
+  static const char *const names_[] = {__VA_ARGS__};                                               \
+  constexpr int total_ = sizeof(names_) / sizeof(names_[0]);                                       \
+  PyObject *a[total_];                                                                             \
+  parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
+#define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
+
+int tp_init(PyObject *self, PyObject *args, PyObject *kwds) {
+  PY_GUARD(-1, {
+    static const char *kwlist[] = {"idle_priority", "ana_mgr", nullptr};
+    PyObject *idle_priority = nullptr, *ana_mgr = nullptr;
+    if (!PyArg_ParseTupleAndKeywords(args, kwds, "OO:__init__", const_cast<char **>(kwlist),
+                                     &idle_priority, &ana_mgr))
+      return -1;
+    co::init(coord(self), arg(idle_priority), arg(ana_mgr));
+    return 0;
+  })
 }
 
+SC_METHOD(Quitting) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("Quitting");
+    co::Quitting(coord(self));
+    return none();
+  })
+}
+SC_METHOD(_destroy_impl) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_destroy_impl");
+    co::destroy_impl(coord(self));
+    return none();
+  })
+}
+SC_METHOD(SuspendIdleScans) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("SuspendIdleScans");
+    co::SuspendIdleScans(ready(self));
+    return none();
+  })
+}
+SC_METHOD(ResumeIdleScans) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("ResumeIdleScans");
+    co::ResumeIdleScans(ready(self));
+    return none();
+  })
+}
+SC_METHOD(_ScheduleIdle) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_ScheduleIdle");
+    co::ScheduleIdle(ready(self));
+    return none();
+  })
+}
+SC_METHOD(_CancelIdle) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_CancelIdle");
+    co::CancelIdle(ready(self));
+    return none();
+  })
+}
+SC_METHOD(_CB_ActiveEditLinenoChanged) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_CB_ActiveEditLinenoChanged", 2, "ana", "new_lineno");
+    co::CB_ActiveEditLinenoChanged(ready(self), arg(a[0]), arg(a[1]));
+    return none();
+  })
+}
+SC_METHOD(_CB_NeedsScanAdded) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_CB_NeedsScanAdded", 3, "info_cache", "needs_scan_added", "priority");
+    co::CB_NeedsScanAdded(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
+    return none();
+  })
+}
+SC_METHOD(AddNeedsScanSetToQueues) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("AddNeedsScanSetToQueues", 1, "needs_scan_set");
+    co::AddNeedsScanSetToQueues(ready(self), arg(a[0]));
+    return none();
+  })
+}
+SC_METHOD(_QueueBasicModules) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_QueueBasicModules", 1, "end_time");
+    return boolean(co::QueueBasicModules(ready(self), arg(a[0])));
+  })
+}
+SC_METHOD(QueuesEmpty) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("QueuesEmpty", 0, "include_waiting");
+    return boolean(co::QueuesEmpty(ready(self), flag(a[0], true)));
+  })
+}
+SC_METHOD(AddParseablesToQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("AddParseablesToQueue", 1, "loc_seq", "priority");
+    py::Borrowed prio = a[1] ? arg(a[1]) : py::Borrowed(state->priorities[kBackgroundPriority]);
+    co::AddParseablesToQueue(ready(self), arg(a[0]), prio);
+    return none();
+  })
+}
+SC_METHOD(_CanSendToHelperProcess) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_CanSendToHelperProcess", 2, "loc", "scope_name");
+    return boolean(co::CanSendToHelperProcess(ready(self), arg(a[0]), arg(a[1])));
+  })
+}
+SC_METHOD(AddPairsToPrimaryQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("AddPairsToPrimaryQueue", 1, "pairs", "first", "priority");
+    co::AddPairsToPrimaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
+                               a[2] ? arg(a[2]) : py::Borrowed(Py_None));
+    return none();
+  })
+}
+SC_METHOD(AddPairsToSecondaryQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("AddPairsToSecondaryQueue", 1, "pairs", "first", "priority");
+    co::AddPairsToSecondaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
+                                 a[2] ? arg(a[2]) : py::Borrowed(Py_None));
+    return none();
+  })
+}
+SC_METHOD(_CB_QueueLocationsAdded) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_CB_QueueLocationsAdded", 2, "queue", "added");
+    co::CB_QueueLocationsAdded(ready(self), arg(a[0]), arg(a[1]));
+    return none();
+  })
+}
+SC_METHOD(LocationInPrimaryScanQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("LocationInPrimaryScanQueue", 1, "loc");
+    return boolean(co::LocationInPrimaryScanQueue(ready(self), arg(a[0])));
+  })
+}
+SC_METHOD(LocationInSecondaryScanQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("LocationInSecondaryScanQueue", 1, "loc");
+    return boolean(co::LocationInSecondaryScanQueue(ready(self), arg(a[0])));
+  })
+}
+SC_METHOD(LocationInScanQueues) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("LocationInScanQueues", 1, "loc");
+    return boolean(co::LocationInScanQueues(ready(self), arg(a[0])));
+  })
+}
+SC_METHOD(RemoveLocationsFromQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("RemoveLocationsFromQueue", 1, "to_remove");
+    co::RemoveLocationsFromQueue(ready(self), arg(a[0]));
+    return none();
+  })
+}
+SC_METHOD(FlushQueue) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("FlushQueue");
+    co::FlushQueue(ready(self));
+    return none();
+  })
+}
+SC_METHOD(ClearLastScanInfo) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("ClearLastScanInfo", 1, "loc_iterable");
+    co::ClearLastScanInfo(ready(self), arg(a[0]));
+    return none();
+  })
+}
+constexpr const char *kIdleLoopNotAvailable =
+    "the idle analysis loop is not available in this build yet";
+SC_METHOD(_CB_DoIdleAnalysis) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_CB_DoIdleAnalysis");
+    (void)self;
+    PyErr_SetString(PyExc_NotImplementedError, kIdleLoopNotAvailable);
+    return nullptr;
+  })
+}
+
+#define SC_DEF(name, doc)                                                                          \
+  {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
+   METH_FASTCALL | METH_KEYWORDS, doc}
+
+PyMethodDef methods[] = {
+    SC_DEF(Quitting, "Called when quitting to stop analysis so that it doesn't clog the remote\n"
+                     "agent connection, which must be flushed on quit"),
+    SC_DEF(_destroy_impl, "Destroy proc to remove idle callback."),
+    SC_DEF(SuspendIdleScans, nullptr),
+    SC_DEF(ResumeIdleScans, nullptr),
+    SC_DEF(_CB_ActiveEditLinenoChanged, nullptr),
+    SC_DEF(_CB_NeedsScanAdded, nullptr),
+    SC_DEF(AddNeedsScanSetToQueues, nullptr),
+    SC_DEF(_QueueBasicModules, nullptr),
+    SC_DEF(QueuesEmpty, nullptr),
+    SC_DEF(AddParseablesToQueue, nullptr),
+    SC_DEF(_CanSendToHelperProcess, nullptr),
+    SC_DEF(AddPairsToPrimaryQueue, nullptr),
+    SC_DEF(AddPairsToSecondaryQueue, nullptr),
+    SC_DEF(_CB_QueueLocationsAdded, nullptr),
+    SC_DEF(_ScheduleIdle, nullptr),
+    SC_DEF(_CancelIdle, nullptr),
+    SC_DEF(LocationInPrimaryScanQueue, nullptr),
+    SC_DEF(LocationInSecondaryScanQueue, nullptr),
+    SC_DEF(LocationInScanQueues, nullptr),
+    SC_DEF(RemoveLocationsFromQueue, nullptr),
+    SC_DEF(FlushQueue, nullptr),
+    SC_DEF(ClearLastScanInfo, nullptr),
+    SC_DEF(_CB_DoIdleAnalysis, nullptr),
+    {nullptr, nullptr, 0, nullptr}};
+
+// ---- fields --------------------------------------------------------------
+
+struct Obj {
+  CDestroyableObject base;
+  co::Fields f;
+};
+
+#define SC_BOOL_GETTER(field)                                                                      \
+  [](PyObject *self, void *) -> PyObject * { return boolean(coord(self)->f.field); }
+#define SC_INT_GETTER(field)                                                                       \
+  [](PyObject *self, void *) -> PyObject * { return PyLong_FromLongLong(coord(self)->f.field); }
+#define SC_FLOAT_GETTER(field)                                                                     \
+  [](PyObject *self, void *) -> PyObject * { return PyFloat_FromDouble(coord(self)->f.field); }
+
+int set_analyze_found_imports(PyObject *self, PyObject *value, void *) {
+  if (!value) {
+    PyErr_SetString(PyExc_NotImplementedError, "__del__");
+    return -1;
+  }
+  int t = PyObject_IsTrue(value);
+  if (t < 0)
+    return -1;
+  coord(self)->f._fAnalyzeFoundImports = t != 0;
+  return 0;
+}
+
+PyGetSetDef getset[] = {
+    {"fAnaMgr", SC_REF_GETTER(Obj, fAnaMgr), nullptr, nullptr, nullptr},
+    {"_fInfoCache", SC_REF_GETTER(Obj, _fInfoCache), nullptr, nullptr, nullptr},
+    {"_fInferenceEngine", SC_REF_GETTER(Obj, _fInferenceEngine), nullptr, nullptr, nullptr},
+    {"fPrefMgr", SC_REF_GETTER(Obj, fPrefMgr), nullptr, nullptr, nullptr},
+    {"fCacheMgr", SC_REF_GETTER(Obj, fCacheMgr), nullptr, nullptr, nullptr},
+    {"fSingletons", SC_REF_GETTER(Obj, fSingletons), nullptr, nullptr, nullptr},
+    {"_fScanQueue", SC_REF_GETTER(Obj, _fScanQueue), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fActiveLoc", SC_REF_GETTER(Obj, fActiveLoc), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fActivePrimaryWholeFileScanners",
+     SC_REF_GETTER(Obj, fActivePrimaryWholeFileScanners), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fActivePrimarySingleScopeScanners",
+     SC_REF_GETTER(Obj, fActivePrimarySingleScopeScanners), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fActiveSecondaryWholeFileScanners",
+     SC_REF_GETTER(Obj, fActiveSecondaryWholeFileScanners), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fActiveSecondarySingleScopeScanners",
+     SC_REF_GETTER(Obj, fActiveSecondarySingleScopeScanners), nullptr, nullptr, nullptr},
+    {"_fIncompleteScansByLoc", SC_REF_GETTER(Obj, _fIncompleteScansByLoc), nullptr, nullptr,
+     nullptr},
+    {"_fCompletedScanCount", SC_REF_GETTER(Obj, _fCompletedScanCount), nullptr, nullptr, nullptr},
+    {"_fIdleProcId", SC_REF_GETTER(Obj, _fIdleProcId), nullptr, nullptr, nullptr},
+    {"_fMTimeAtLastWholeFileCheck", SC_REF_GETTER(Obj, _fMTimeAtLastWholeFileCheck), nullptr,
+     nullptr, nullptr},
+    {"fIdlePriority", SC_INT_GETTER(fIdlePriority), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fCompletedLocs", SC_REF_GETTER(Obj, fCompletedLocs), nullptr, nullptr,
+     nullptr},
+    {"_CScanCoordinator__fStatusTimeout", SC_REF_GETTER(Obj, fStatusTimeout), nullptr, nullptr,
+     nullptr},
+    {"_fLastScanCompleted", SC_REF_GETTER(Obj, _fLastScanCompleted), nullptr, nullptr, nullptr},
+    {"_CScanCoordinator__fQuitting", SC_BOOL_GETTER(fQuitting), nullptr, nullptr, nullptr},
+    {"_fAllBasicModuleQueued", SC_BOOL_GETTER(_fAllBasicModuleQueued), nullptr, nullptr, nullptr},
+    {"_fAnalyzeFoundImports", SC_BOOL_GETTER(_fAnalyzeFoundImports), set_analyze_found_imports,
+     nullptr, nullptr},
+    {"_fRemoteLocationsReady", SC_REF_GETTER(Obj, _fRemoteLocationsReady), nullptr, nullptr,
+     nullptr},
+    {"_fActiveScanNowTriples", SC_REF_GETTER(Obj, _fActiveScanNowTriples), nullptr, nullptr,
+     nullptr},
+    {"_fPendingScanNowTriples", SC_REF_GETTER(Obj, _fPendingScanNowTriples), nullptr, nullptr,
+     nullptr},
+    {"fActiveScanItem", SC_REF_GETTER(Obj, fActiveScanItem), nullptr, nullptr, nullptr},
+    {"_fScanTripleCompletedCount", SC_REF_GETTER(Obj, _fScanTripleCompletedCount), nullptr,
+     nullptr, nullptr},
+    {"fLog", SC_REF_GETTER(Obj, fLog), nullptr, nullptr, nullptr},
+    {"_fActiveIdleStart", SC_FLOAT_GETTER(_fActiveIdleStart), nullptr, nullptr, nullptr},
+    {"_fLastLogQueue", SC_FLOAT_GETTER(_fLastLogQueue), nullptr, nullptr, nullptr},
+    {"fWaitingForRemote", SC_BOOL_GETTER(fWaitingForRemote), nullptr, nullptr, nullptr},
+    {"_fLocsQueuedInHelper", SC_REF_GETTER(Obj, _fLocsQueuedInHelper), nullptr, nullptr, nullptr},
+    {"_fIdleToWriteToDatabase", SC_REF_GETTER(Obj, _fIdleToWriteToDatabase), nullptr, nullptr,
+     nullptr},
+    {"_fHelperCallbackObjConnected", SC_REF_GETTER(Obj, _fHelperCallbackObjConnected), nullptr,
+     nullptr, nullptr},
+    {"_fIdleScanSuspendCount", SC_INT_GETTER(_fIdleScanSuspendCount), nullptr, nullptr, nullptr},
+    {nullptr, nullptr, nullptr, nullptr, nullptr}};
+
 PyType_Slot slots[] = {{Py_tp_doc, const_cast<char *>("Class to coordinate scanning of files")},
-                       {Py_tp_new, reinterpret_cast<void *>(tp_new)},
+                       {Py_tp_new, reinterpret_cast<void *>(typed_new<Obj>)},
+                       {Py_tp_init, reinterpret_cast<void *>(tp_init)},
                        {Py_tp_dealloc, reinterpret_cast<void *>(typed_dealloc<Obj>)},
                        {Py_tp_traverse, reinterpret_cast<void *>(typed_traverse<Obj>)},
                        {Py_tp_clear, reinterpret_cast<void *>(typed_clear<Obj>)},
+                       {Py_tp_methods, methods},
+                       {Py_tp_getset, getset},
                        {0, nullptr}};
 
-PyType_Spec spec = {"pysource.scancoordinator.CScanCoordinator",
-                    static_cast<int>(sizeof(Obj)), 0,
+PyType_Spec spec = {"pysource.scancoordinator.CScanCoordinator", sizeof(Obj), 0,
                     Py_TPFLAGS_DEFAULT | Py_TPFLAGS_BASETYPE | Py_TPFLAGS_HAVE_GC, slots};
 
+// ---- dispatch ------------------------------------------------------------
+
+using Fast = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyObject *);
+
+// Whether `name` on this object is our own implementation; otherwise
+// `override_out` receives the attribute to call.
+bool own(C *c, const char *name, Fast fn, py::Ref &override_out) {
+  PyObject *self = reinterpret_cast<PyObject *>(c);
+  if (Py_TYPE(self) == state->CoordinatorType)
+    return true;
+  py::Ref meth = py::getattr(py::Borrowed(self), name);
+  if (PyCFunction_Check(meth.get()) &&
+      reinterpret_cast<void (*)()>(PyCFunction_GET_FUNCTION(meth.get())) ==
+          reinterpret_cast<void (*)()>(fn) &&
+      PyCFunction_GET_SELF(meth.get()) == self)
+    return true;
+  override_out = std::move(meth);
+  return false;
+}
+
 } // namespace
+
+namespace co::call {
+
+void ScheduleIdle(C *c) {
+  py::Ref ov;
+  if (own(c, "_ScheduleIdle", m__ScheduleIdle, ov))
+    return co::ScheduleIdle(c);
+  py::call(ov);
+}
+void CancelIdle(C *c) {
+  py::Ref ov;
+  if (own(c, "_CancelIdle", m__CancelIdle, ov))
+    return co::CancelIdle(c);
+  py::call(ov);
+}
+bool QueuesEmpty(C *c, bool include_waiting) {
+  py::Ref ov;
+  if (own(c, "QueuesEmpty", m_QueuesEmpty, ov))
+    return co::QueuesEmpty(c, include_waiting);
+  return py::truth(py::call(ov, py::Borrowed(include_waiting ? Py_True : Py_False)));
+}
+void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority) {
+  py::Ref ov;
+  if (own(c, "AddPairsToPrimaryQueue", m_AddPairsToPrimaryQueue, ov))
+    return co::AddPairsToPrimaryQueue(c, pairs, first, priority);
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, py::interned("priority").get())));
+  PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
+  py::call_kw(ov, argv, 2, *kw);
+}
+void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority) {
+  py::Ref ov;
+  if (own(c, "AddPairsToSecondaryQueue", m_AddPairsToSecondaryQueue, ov))
+    return co::AddPairsToSecondaryQueue(c, pairs, first, priority);
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, py::interned("priority").get())));
+  PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
+  py::call_kw(ov, argv, 2, *kw);
+}
+bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name) {
+  py::Ref ov;
+  if (own(c, "_CanSendToHelperProcess", m__CanSendToHelperProcess, ov))
+    return co::CanSendToHelperProcess(c, loc, scope_name);
+  return py::truth(py::call(ov, loc, scope_name));
+}
+void ClearLastScanInfo(C *c, Borrowed loc_iterable) {
+  py::Ref ov;
+  if (own(c, "ClearLastScanInfo", m_ClearLastScanInfo, ov))
+    return co::ClearLastScanInfo(c, loc_iterable);
+  py::call(ov, loc_iterable);
+}
+
+} // namespace co::call
 
 PyTypeObject *create_coordinator_type(py::Borrowed module) {
   py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));

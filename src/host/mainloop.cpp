@@ -17,6 +17,11 @@ py::Ref idle_add(py::Borrowed callback, py::Borrowed priority) {
   return py::call_kw(f, argv, 1, *kwnames);
 }
 
+py::Ref idle_add_while_alive(py::Borrowed callback, py::Borrowed owner) {
+  static py::Ref *name = new py::Ref(py::interned("idle_add_while_alive"));
+  return py::call(fn(*name), callback, owner);
+}
+
 void idle_remove(py::Borrowed id) { py::call(fn(names().idle_remove), id); }
 
 py::Ref timeout_add_while_alive(long ms, py::Borrowed callback, py::Borrowed owner) {

@@ -12,6 +12,8 @@ py::Ref idle_add(py::Borrowed callback);
 // ostrelgtk.idle_add(callback, priority=priority) -> id
 py::Ref idle_add(py::Borrowed callback, py::Borrowed priority);
 void idle_remove(py::Borrowed id);
+// ostrelgtk.idle_add_while_alive(callback, owner) -> id
+py::Ref idle_add_while_alive(py::Borrowed callback, py::Borrowed owner);
 // ostrelgtk.timeout_add_while_alive(ms, callback, owner) -> id
 py::Ref timeout_add_while_alive(long ms, py::Borrowed callback, py::Borrowed owner);
 void timeout_remove(py::Borrowed id);

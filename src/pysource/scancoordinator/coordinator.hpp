@@ -142,6 +142,13 @@ void CB_QueueLocationsAdded(C *c, Borrowed queue, Borrowed added);
 // ---- helper process ------------------------------------------------------
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 
+// ---- status and database writes -----------------------------------------
+Ref GetStatus(C *c);
+void EnsureStatusTimeout(C *c);
+bool CB_UpdateStatus(C *c);
+void ScheduleWriteToDatabaseIdle(C *c);
+void CB_WriteToDatabase(C *c);
+
 // ---- overridable dispatch (defined with the Python face) -----------------
 namespace call {
 void ScheduleIdle(C *c);
@@ -151,6 +158,7 @@ void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed prior
 void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority);
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 void ClearLastScanInfo(C *c, Borrowed loc_iterable);
+Ref GetStatus(C *c);
 } // namespace call
 
 } // namespace scancoord::co

@@ -28,7 +28,10 @@ constexpr const char *kSignals[] = {"scheduled", "end", "scan-status-update", "m
 
 Ref signal_name(int i) { return py::interned(kSignals[i]); }
 
-C *coord(PyObject *self) { return reinterpret_cast<C *>(self); }
+// Handlers are plain functions, like closures over the coordinator: each is
+// bound to a one-item tuple holding it (its "cell"), not to the coordinator
+// itself, so it does not present itself as a method of the coordinator.
+C *coord(PyObject *cell) { return reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0)); }
 
 // ---- handlers made by the constructor ------------------------------------
 
@@ -52,16 +55,16 @@ PyObject *on_modified(PyObject *self, PyObject *ana) {
   })
 }
 
-PyObject *on_external_mod(PyObject *weak_self, PyObject *args) {
+PyObject *on_external_mod(PyObject *cell, PyObject *args) {
   PY_GUARD(nullptr, {
     PyObject *savable_mgr, *mod_dict;
     if (!PyArg_UnpackTuple(args, "on_external_mod", 2, 2, &savable_mgr, &mod_dict))
       return nullptr;
-    Ref self = Ref::borrow(PyWeakref_GetObject(weak_self));
+    Ref self = Ref::borrow(PyWeakref_GetObject(PyTuple_GET_ITEM(cell, 0)));
     if (!self || self.is_none())
       Py_RETURN_NONE; // the coordinator is gone
     Ref changed = py::check(PySet_New(mod_dict));
-    Ref last = coord(self.get())->f._fLastScanCompleted;
+    Ref last = reinterpret_cast<C *>(self.get())->f._fLastScanCompleted;
     py::for_each(changed, [&](Borrowed loc) {
       if (py::dict_contains(last, loc))
         py::dict_del(last, loc);
@@ -120,7 +123,8 @@ PyMethodDef def_on_import_resolution_changed = {
     "on_import_resolution_changed", on_import_resolution_changed, METH_NOARGS, nullptr};
 
 Ref handler(PyMethodDef *def, Borrowed bound_to) {
-  return py::check(PyCFunction_NewEx(def, bound_to.get(), nullptr));
+  Ref cell = py::check(PyTuple_Pack(1, bound_to.get()));
+  return py::check(PyCFunction_NewEx(def, cell.get(), nullptr));
 }
 
 Ref class_connect_while_alive(Borrowed cls, const char *signal, Borrowed cb, Borrowed owner) {

@@ -202,6 +202,39 @@ SC_METHOD(ClearLastScanInfo) {
     return none();
   })
 }
+SC_METHOD(GetStatus) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("GetStatus");
+    return co::GetStatus(ready(self)).release();
+  })
+}
+SC_METHOD(__EnsureStatusTimeout) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("__EnsureStatusTimeout");
+    co::EnsureStatusTimeout(ready(self));
+    return none();
+  })
+}
+SC_METHOD(_CB_UpdateStatus) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_CB_UpdateStatus");
+    return boolean(co::CB_UpdateStatus(ready(self)));
+  })
+}
+SC_METHOD(_ScheduleWriteToDatabaseIdle) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_ScheduleWriteToDatabaseIdle");
+    co::ScheduleWriteToDatabaseIdle(ready(self));
+    return none();
+  })
+}
+SC_METHOD(_CB_WriteToDatabase) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_CB_WriteToDatabase");
+    co::CB_WriteToDatabase(ready(self));
+    return none();
+  })
+}
 constexpr const char *kIdleLoopNotAvailable =
     "the idle analysis loop is not available in this build yet";
 SC_METHOD(_CB_DoIdleAnalysis) {
@@ -242,6 +275,15 @@ PyMethodDef methods[] = {
     SC_DEF(FlushQueue, nullptr),
     SC_DEF(ClearLastScanInfo, nullptr),
     SC_DEF(_CB_DoIdleAnalysis, nullptr),
+    SC_DEF(GetStatus, nullptr),
+    {"_CScanCoordinator__EnsureStatusTimeout",
+     reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m___EnsureStatusTimeout)),
+     METH_FASTCALL | METH_KEYWORDS,
+     "Make sure that the status timeout is installed or removed according to whether work is\n"
+     "being done; removal is done by the callback itself"},
+    SC_DEF(_CB_UpdateStatus, "Called periodically to update status"),
+    SC_DEF(_ScheduleWriteToDatabaseIdle, "Schedule an idle that will call WriteToDatabase()"),
+    SC_DEF(_CB_WriteToDatabase, nullptr),
     {nullptr, nullptr, 0, nullptr}};
 
 // ---- fields --------------------------------------------------------------
@@ -406,6 +448,13 @@ void ClearLastScanInfo(C *c, Borrowed loc_iterable) {
   if (own(c, "ClearLastScanInfo", m_ClearLastScanInfo, ov))
     return co::ClearLastScanInfo(c, loc_iterable);
   py::call(ov, loc_iterable);
+}
+
+py::Ref GetStatus(C *c) {
+  py::Ref ov;
+  if (own(c, "GetStatus", m_GetStatus, ov))
+    return co::GetStatus(c);
+  return py::call(ov);
 }
 
 } // namespace co::call

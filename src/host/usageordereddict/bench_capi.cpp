@@ -32,9 +32,14 @@ struct OpName {
   Op op;
 };
 constexpr OpName kOps[] = {
-    {"get", Op::kGet},          {"get_first", Op::kGetFirst},       {"set_front", Op::kSetFront},
-    {"set_back", Op::kSetBack}, {"insert_front", Op::kInsertFront}, {"insert_back", Op::kInsertBack},
-    {"pop", Op::kPop},          {"del", Op::kDel},
+    {"get", Op::kGet},
+    {"get_first", Op::kGetFirst},
+    {"set_front", Op::kSetFront},
+    {"set_back", Op::kSetBack},
+    {"insert_front", Op::kInsertFront},
+    {"insert_back", Op::kInsertBack},
+    {"pop", Op::kPop},
+    {"del", Op::kDel},
 };
 
 Op parse_op(PyObject *name) {
@@ -80,8 +85,8 @@ double time_mapping(const CUsageOrderedDict_CAPI *api, Op op, PyObject *keys, Py
   case Op::kInsertBack: {
     const int first = op == Op::kSetFront || op == Op::kInsertFront;
     for (Py_ssize_t i = 0; i < n; ++i)
-      py::check_int(
-          api->set(d.get(), PyList_GET_ITEM(probe, i), PyList_GET_ITEM(values, (i + 1) % nv), first));
+      py::check_int(api->set(d.get(), PyList_GET_ITEM(probe, i),
+                             PyList_GET_ITEM(values, (i + 1) % nv), first));
     break;
   }
   case Op::kPop:
@@ -120,8 +125,8 @@ double time_dict(Op op, PyObject *keys, PyObject *values, PyObject *probe) {
   case Op::kInsertFront:
   case Op::kInsertBack:
     for (Py_ssize_t i = 0; i < n; ++i)
-      py::check_int(
-          PyDict_SetItem(d.get(), PyList_GET_ITEM(probe, i), PyList_GET_ITEM(values, (i + 1) % nv)));
+      py::check_int(PyDict_SetItem(d.get(), PyList_GET_ITEM(probe, i),
+                                   PyList_GET_ITEM(values, (i + 1) % nv)));
     break;
   case Op::kPop:
     for (Py_ssize_t i = 0; i < n; ++i)

@@ -41,6 +41,7 @@
 #include <structmember.h>
 
 #include <cstddef>
+#include <initializer_list>
 
 namespace uod {
 namespace {
@@ -163,12 +164,29 @@ CUsageOrderedDict_CAPI g_capi = {
 
 // ---- argument parsing for METH_FASTCALL | METH_KEYWORDS ---------------------------
 
+constexpr int kMaxParams = 3;
+
 struct Signature {
   const char *name;
-  const char *const *params;
+  const char *params[kMaxParams];
   int required;
   int max;
+  // The parameter names as interned str, filled in at module initialisation
+  // and kept for the life of the process: keyword names arrive interned, so
+  // a pointer comparison almost always decides.
+  PyObject *interned[kMaxParams];
 };
+
+// Index of the parameter called `name`, or sig.max.
+int param_index(const Signature &sig, PyObject *name) {
+  for (int k = 0; k < sig.max; ++k)
+    if (name == sig.interned[k])
+      return k;
+  for (int k = 0; k < sig.max; ++k)
+    if (PyUnicode_CompareWithASCIIString(name, sig.params[k]) == 0)
+      return k;
+  return sig.max;
+}
 
 // Fill out[0 .. sig.max) with the borrowed arguments; optional ones that were
 // not passed stay nullptr.
@@ -183,9 +201,7 @@ void parse_args(const Signature &sig, PyObject *const *args, Py_ssize_t nargs, P
     out[i] = i < nargs ? args[i] : nullptr;
   for (Py_ssize_t j = 0; j < nkw; ++j) {
     PyObject *name = PyTuple_GET_ITEM(kwnames, j);
-    int k = 0;
-    while (k < sig.max && PyUnicode_CompareWithASCIIString(name, sig.params[k]) != 0)
-      ++k;
+    const int k = param_index(sig, name);
     if (k == sig.max) {
       PyErr_Format(PyExc_TypeError, msg::kUnexpectedKeyword, sig.name, name);
       py::throw_error();
@@ -208,17 +224,19 @@ void parse_args(const Signature &sig, PyObject *const *args, Py_ssize_t nargs, P
 // evaluate it before touching the table.
 bool flag(PyObject *arg) { return arg && py::truth(py::Borrowed(arg)); }
 
-constexpr const char *kGetParams[] = {"key", "default", "first"};
-constexpr Signature kGetSig = {"get", kGetParams, 1, 3};
-constexpr const char *kSetParams[] = {"key", "value", "first"};
-constexpr Signature kSetSig = {"Set", kSetParams, 2, 3};
-constexpr const char *kPopParams[] = {"key", "default"};
-constexpr Signature kPopSig = {"pop", kPopParams, 1, 2};
+Signature g_get_sig = {"get", {"key", "default", "first"}, 1, 3, {}};
+Signature g_set_sig = {"Set", {"key", "value", "first"}, 2, 3, {}};
+Signature g_pop_sig = {"pop", {"key", "default"}, 1, 2, {}};
+
+void intern_params(Signature &sig) {
+  for (int k = 0; k < sig.max; ++k)
+    sig.interned[k] = py::interned(sig.params[k]).release(); // kept for the process's life
+}
 
 // ---- entry snapshots (_fFirst / _fLast) ------------------------------------------
 
 struct EntryObject {
-  PyObject_HEAD
+  PyObject ob_base;
   py::Ref key;
   py::Ref val;
 };
@@ -302,9 +320,9 @@ PyType_Spec entry_spec = {
 enum class IterKind { kKeys, kValues, kItems };
 
 struct IterObject {
-  PyObject_HEAD
+  PyObject ob_base;
   py::Ref mapping; // empty once exhausted
-  Index cursor; // the next entry to yield, or kNone
+  Index cursor;    // the next entry to yield, or kNone
   std::uint64_t order_version;
   Py_ssize_t remaining;
   IterKind kind;
@@ -439,14 +457,16 @@ void uod_dealloc(PyObject *self) {
   PyTypeObject *tp = Py_TYPE(self);
   PyObject_GC_UnTrack(self);
   // Deeply nested mappings would otherwise recurse once per level here.
+  // clang-format off
   Py_TRASHCAN_BEGIN(self, uod_dealloc)
-  if (reinterpret_cast<UodObject *>(self)->weakreflist)
-    PyObject_ClearWeakRefs(self);
-  table_of(self).clear();
-  table_of(self).~Table();
-  tp->tp_free(self);
-  Py_DECREF(tp);
+    if (reinterpret_cast<UodObject *>(self)->weakreflist)
+      PyObject_ClearWeakRefs(self);
+    table_of(self).clear();
+    table_of(self).~Table();
+    tp->tp_free(self);
+    Py_DECREF(tp);
   Py_TRASHCAN_END
+  // clang-format on
 }
 
 // Py_ReprEnter / Py_ReprLeave as a scope.
@@ -524,7 +544,7 @@ int uod_contains(PyObject *self, PyObject *key) {
 
 py::Ref get_method(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames) {
   PyObject *argv[3];
-  parse_args(kGetSig, args, nargs, kwnames, argv);
+  parse_args(g_get_sig, args, nargs, kwnames, argv);
   const bool first = flag(argv[2]);
   PyObject *value = capi_get(self, argv[0], first);
   if (!value) {
@@ -537,7 +557,7 @@ py::Ref get_method(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyOb
 
 py::Ref set_method(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames) {
   PyObject *argv[3];
-  parse_args(kSetSig, args, nargs, kwnames, argv);
+  parse_args(g_set_sig, args, nargs, kwnames, argv);
   const bool first = flag(argv[2]);
   py::check_int(capi_set(self, argv[0], argv[1], first));
   return py::Ref::none();
@@ -545,7 +565,7 @@ py::Ref set_method(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyOb
 
 py::Ref pop_method(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames) {
   PyObject *argv[2];
-  parse_args(kPopSig, args, nargs, kwnames, argv);
+  parse_args(g_pop_sig, args, nargs, kwnames, argv);
   py::Ref value = py::Ref::steal(capi_pop(self, argv[0]));
   if (value)
     return value;
@@ -618,7 +638,7 @@ PyMethodDef uod_methods[] = {
      "existing key takes the new value and moves to that end."},
     {"pop", reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(uod_pop)),
      METH_FASTCALL | METH_KEYWORDS,
-     "pop($self, key, default=<unrepresentable>, /)\n--\n\n"
+     "pop(key[, default])\n\n"
      "Remove key and return its value; default when it is absent, or KeyError\n"
      "when no default is given."},
     {"clear", uod_clear_method, METH_NOARGS, "Remove every entry."},
@@ -644,11 +664,11 @@ PyMemberDef uod_members[] = {
 };
 
 PyType_Slot uod_slots[] = {
-    {Py_tp_doc, const_cast<char *>(
-                    "CUsageOrderedDict()\n--\n\n"
-                    "A mapping whose order callers steer: entries are stored at either end\n"
-                    "and move to the front when looked up with first=True.  Lookup, moves,\n"
-                    "insertion and removal take constant time.")},
+    {Py_tp_doc,
+     const_cast<char *>("CUsageOrderedDict()\n--\n\n"
+                        "A mapping whose order callers steer: entries are stored at either end\n"
+                        "and move to the front when looked up with first=True.  Lookup, moves,\n"
+                        "insertion and removal take constant time.")},
     {Py_tp_new, reinterpret_cast<void *>(uod_new)},
     {Py_tp_init, reinterpret_cast<void *>(uod_init)},
     {Py_tp_dealloc, reinterpret_cast<void *>(uod_dealloc)},
@@ -705,6 +725,8 @@ PyTypeObject *add_type(PyObject *module, PyType_Spec *spec) {
 
 py::Ref init_module() {
   py::Ref module = py::check(PyModule_Create(&module_def));
+  for (Signature *sig : {&g_get_sig, &g_set_sig, &g_pop_sig})
+    intern_params(*sig);
   g_type = add_type(module.get(), &uod_spec);
   g_entry_type = add_type(module.get(), &entry_spec);
   g_iter_type = add_type(module.get(), &iter_spec);

@@ -15,13 +15,14 @@
 namespace uod {
 
 struct UodObject {
-  PyObject_HEAD
+  PyObject ob_base;
   PyObject *weakreflist; // managed by CPython (PyObject_ClearWeakRefs)
   alignas(Table) unsigned char table_storage[sizeof(Table)];
 };
 
 inline Table &table_of(PyObject *self) noexcept {
-  return *std::launder(reinterpret_cast<Table *>(reinterpret_cast<UodObject *>(self)->table_storage));
+  return *std::launder(
+      reinterpret_cast<Table *>(reinterpret_cast<UodObject *>(self)->table_storage));
 }
 
 // _bench_capi(op, keys, values, probe_keys, dict_first) in bench_capi.cpp.

@@ -74,12 +74,8 @@ template <typename T> struct PyMemAllocator {
     return static_cast<T *>(p);
   }
   void deallocate(T *p, std::size_t) noexcept { PyMem_Free(p); }
-  template <typename U> bool operator==(const PyMemAllocator<U> &) const noexcept {
-    return true;
-  }
-  template <typename U> bool operator!=(const PyMemAllocator<U> &) const noexcept {
-    return false;
-  }
+  template <typename U> bool operator==(const PyMemAllocator<U> &) const noexcept { return true; }
+  template <typename U> bool operator!=(const PyMemAllocator<U> &) const noexcept { return false; }
 };
 
 using Index = std::int32_t;
@@ -193,8 +189,7 @@ inline bool unicode_equal(PyObject *a, PyObject *b) noexcept {
   const int kind = PyUnicode_KIND(a);
   if (kind != static_cast<int>(PyUnicode_KIND(b)))
     return false;
-  return std::memcmp(PyUnicode_DATA(a), PyUnicode_DATA(b), static_cast<std::size_t>(n) * kind) ==
-         0;
+  return std::memcmp(PyUnicode_DATA(a), PyUnicode_DATA(b), static_cast<std::size_t>(n) * kind) == 0;
 }
 
 inline Table::Found Table::lookup(PyObject *key, Py_hash_t hash) {

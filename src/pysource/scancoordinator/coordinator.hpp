@@ -142,6 +142,28 @@ void CB_QueueLocationsAdded(C *c, Borrowed queue, Borrowed added);
 // ---- helper process ------------------------------------------------------
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 
+// ---- idle loop -------------------------------------------------------------
+double now_time();
+void log(C *c, const char *message);
+void log(C *c, const char *format, Borrowed value);
+PyObject *CB_DoIdleAnalysis(C *c); // True, False or None; NULL with an exception
+void DoScans(C *c, double end_time);
+bool CheckWholeFiles(C *c, double end_time);
+bool DoSingleScan(C *c, Borrowed scan_item, double end_time);
+Ref GetAnalysis(C *c, Borrowed loc, bool create);
+
+// ---- scan execution ----------------------------------------------------------
+bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time);
+bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time);
+bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time);
+bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item);
+
+// ---- modification times and import equivalents ------------------------------
+void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority);
+Ref GetModtimeDict(C *c, Borrowed loc_seq);
+void GetModtimes(C *c, Borrowed loc_seq, Borrowed completion_cb, Borrowed force);
+
 // ---- status and database writes -----------------------------------------
 Ref GetStatus(C *c);
 void EnsureStatusTimeout(C *c);
@@ -159,6 +181,22 @@ void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed pri
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 void ClearLastScanInfo(C *c, Borrowed loc_iterable);
 Ref GetStatus(C *c);
+void EnsureStatusTimeout(C *c);
+void ScheduleWriteToDatabaseIdle(C *c);
+bool QueueBasicModules(C *c, Borrowed end_time);
+void DoScans(C *c, double end_time);
+bool CheckWholeFiles(C *c, double end_time);
+bool DoSingleScan(C *c, Borrowed scan_item, double end_time);
+Ref GetAnalysis(C *c, Borrowed loc, bool create);
+Ref GetModtimeDict(C *c, Borrowed loc_seq);
+bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time);
+bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time);
+bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time);
+bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+// Plain methods that the coordinator reaches through attribute lookup.
+void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority);
+void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item);
+void BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
 } // namespace call
 
 } // namespace scancoord::co

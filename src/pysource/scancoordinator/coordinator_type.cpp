@@ -235,19 +235,103 @@ SC_METHOD(_CB_WriteToDatabase) {
     return none();
   })
 }
-constexpr const char *kIdleLoopNotAvailable =
-    "the idle analysis loop is not available in this build yet";
 SC_METHOD(_CB_DoIdleAnalysis) {
   PY_GUARD(nullptr, {
     SC_NOARGS("_CB_DoIdleAnalysis");
-    (void)self;
-    PyErr_SetString(PyExc_NotImplementedError, kIdleLoopNotAvailable);
-    return nullptr;
+    return co::CB_DoIdleAnalysis(ready(self));
+  })
+}
+double as_time(PyObject *o) {
+  double v = PyFloat_AsDouble(o);
+  if (v == -1.0 && PyErr_Occurred())
+    py::throw_error();
+  return v;
+}
+SC_METHOD(__DoScans) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__DoScans", 1, "end_time");
+    co::DoScans(ready(self), as_time(a[0]));
+    return none();
+  })
+}
+SC_METHOD(__CheckWholeFiles) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__CheckWholeFiles", 1, "end_time");
+    return boolean(co::CheckWholeFiles(ready(self), as_time(a[0])));
+  })
+}
+SC_METHOD(_DoSingleScan) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_DoSingleScan", 2, "scan_item", "end_time");
+    return boolean(co::DoSingleScan(ready(self), arg(a[0]), as_time(a[1])));
+  })
+}
+SC_METHOD(__GetAnalysis) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__GetAnalysis", 2, "loc", "create");
+    return co::GetAnalysis(ready(self), arg(a[0]), flag(a[1], false)).release();
+  })
+}
+SC_METHOD(__DoPrimaryWholeFileScan) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__DoPrimaryWholeFileScan", 2, "scan_item", "end_time");
+    return boolean(co::DoPrimaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
+  })
+}
+SC_METHOD(__DoPrimarySingleScopeScan) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__DoPrimarySingleScopeScan", 2, "scan_item", "end_time");
+    return boolean(co::DoPrimarySingleScopeScan(ready(self), arg(a[0]), as_time(a[1])));
+  })
+}
+SC_METHOD(__DoSecondaryWholeFileScan) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__DoSecondaryWholeFileScan", 2, "scan_item", "end_time");
+    return boolean(co::DoSecondaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
+  })
+}
+SC_METHOD(__DoSecondarySingleScopeScan) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__DoSecondarySingleScopeScan", 3, "loc", "scope_name", "end_time");
+    return boolean(
+        co::DoSecondarySingleScopeScan(ready(self), arg(a[0]), arg(a[1]), as_time(a[2])));
+  })
+}
+SC_METHOD(_WaitForScannerToBeReady) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_WaitForScannerToBeReady", 2, "scanner", "scan_item");
+    co::WaitForScannerToBeReady(ready(self), arg(a[0]), arg(a[1]));
+    return none();
+  })
+}
+SC_METHOD(__AddImportEquivsToQueue) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__AddImportEquivsToQueue", 3, "imported_equivs", "dirloc", "priority");
+    co::AddImportEquivsToQueue(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
+    return none();
+  })
+}
+SC_METHOD(__GetModtimeDict) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__GetModtimeDict", 1, "loc_seq");
+    return co::GetModtimeDict(ready(self), arg(a[0])).release();
+  })
+}
+SC_METHOD(__GetModtimes) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("__GetModtimes", 2, "loc_seq", "completion_cb", "force");
+    co::GetModtimes(ready(self), arg(a[0]), arg(a[1]), a[2] ? arg(a[2]) : py::Borrowed(Py_False));
+    return none();
   })
 }
 
 #define SC_DEF(name, doc)                                                                          \
   {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
+   METH_FASTCALL | METH_KEYWORDS, doc}
+// A class-private method, published under its mangled name.
+#define SC_PRIVATE(name, doc)                                                                      \
+  {"_CScanCoordinator" #name,                                                                      \
+   reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                          \
    METH_FASTCALL | METH_KEYWORDS, doc}
 
 PyMethodDef methods[] = {
@@ -274,13 +358,26 @@ PyMethodDef methods[] = {
     SC_DEF(RemoveLocationsFromQueue, nullptr),
     SC_DEF(FlushQueue, nullptr),
     SC_DEF(ClearLastScanInfo, nullptr),
-    SC_DEF(_CB_DoIdleAnalysis, nullptr),
+    SC_DEF(_CB_DoIdleAnalysis, "Do analysis on individual lines in background mode."),
+    SC_PRIVATE(__DoScans, "Do idle scans until time() > end_time."),
+    SC_PRIVATE(__CheckWholeFiles,
+               "Check whole file entries in the primary queue to see if they really need to be\n"
+               "rescanned, adding them to the secondary queue if needed.  Returns True if ran\n"
+               "out of time and False if not."),
+    SC_DEF(_DoSingleScan, "Scan single queued item"),
+    SC_PRIVATE(__GetAnalysis, nullptr),
+    SC_PRIVATE(__DoPrimaryWholeFileScan, nullptr),
+    SC_PRIVATE(__DoPrimarySingleScopeScan, "Idle analysis of a single scope"),
+    SC_PRIVATE(__DoSecondaryWholeFileScan, nullptr),
+    SC_PRIVATE(__DoSecondarySingleScopeScan, nullptr),
+    SC_DEF(_WaitForScannerToBeReady, nullptr),
+    SC_PRIVATE(__AddImportEquivsToQueue, nullptr),
+    SC_PRIVATE(__GetModtimeDict, nullptr),
+    SC_PRIVATE(__GetModtimes, nullptr),
     SC_DEF(GetStatus, nullptr),
-    {"_CScanCoordinator__EnsureStatusTimeout",
-     reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m___EnsureStatusTimeout)),
-     METH_FASTCALL | METH_KEYWORDS,
+    SC_PRIVATE(__EnsureStatusTimeout,
      "Make sure that the status timeout is installed or removed according to whether work is\n"
-     "being done; removal is done by the callback itself"},
+     "being done; removal is done by the callback itself"),
     SC_DEF(_CB_UpdateStatus, "Called periodically to update status"),
     SC_DEF(_ScheduleWriteToDatabaseIdle, "Schedule an idle that will call WriteToDatabase()"),
     SC_DEF(_CB_WriteToDatabase, nullptr),
@@ -455,6 +552,96 @@ py::Ref GetStatus(C *c) {
   if (own(c, "GetStatus", m_GetStatus, ov))
     return co::GetStatus(c);
   return py::call(ov);
+}
+
+void EnsureStatusTimeout(C *c) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__EnsureStatusTimeout", m___EnsureStatusTimeout, ov))
+    return co::EnsureStatusTimeout(c);
+  py::call(ov);
+}
+void ScheduleWriteToDatabaseIdle(C *c) {
+  py::Ref ov;
+  if (own(c, "_ScheduleWriteToDatabaseIdle", m__ScheduleWriteToDatabaseIdle, ov))
+    return co::ScheduleWriteToDatabaseIdle(c);
+  py::call(ov);
+}
+bool QueueBasicModules(C *c, Borrowed end_time) {
+  py::Ref ov;
+  if (own(c, "_QueueBasicModules", m__QueueBasicModules, ov))
+    return co::QueueBasicModules(c, end_time);
+  return py::truth(py::call(ov, end_time));
+}
+void DoScans(C *c, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__DoScans", m___DoScans, ov))
+    return co::DoScans(c, end_time);
+  py::call(ov, py::floating(end_time));
+}
+bool CheckWholeFiles(C *c, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__CheckWholeFiles", m___CheckWholeFiles, ov))
+    return co::CheckWholeFiles(c, end_time);
+  return py::truth(py::call(ov, py::floating(end_time)));
+}
+bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
+  py::Ref ov;
+  if (own(c, "_DoSingleScan", m__DoSingleScan, ov))
+    return co::DoSingleScan(c, scan_item, end_time);
+  return py::truth(py::call(ov, scan_item, py::floating(end_time)));
+}
+py::Ref GetAnalysis(C *c, Borrowed loc, bool create) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__GetAnalysis", m___GetAnalysis, ov))
+    return co::GetAnalysis(c, loc, create);
+  return py::call(ov, loc, py::Borrowed(create ? Py_True : Py_False));
+}
+py::Ref GetModtimeDict(C *c, Borrowed loc_seq) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__GetModtimeDict", m___GetModtimeDict, ov))
+    return co::GetModtimeDict(c, loc_seq);
+  return py::call(ov, loc_seq);
+}
+bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__DoPrimaryWholeFileScan", m___DoPrimaryWholeFileScan, ov))
+    return co::DoPrimaryWholeFileScan(c, scan_item, end_time);
+  return py::truth(py::call(ov, scan_item, py::floating(end_time)));
+}
+bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__DoPrimarySingleScopeScan", m___DoPrimarySingleScopeScan, ov))
+    return co::DoPrimarySingleScopeScan(c, scan_item, end_time);
+  return py::truth(py::call(ov, scan_item, py::floating(end_time)));
+}
+bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__DoSecondaryWholeFileScan", m___DoSecondaryWholeFileScan, ov))
+    return co::DoSecondaryWholeFileScan(c, scan_item, end_time);
+  return py::truth(py::call(ov, scan_item, py::floating(end_time)));
+}
+bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__DoSecondarySingleScopeScan", m___DoSecondarySingleScopeScan,
+          ov))
+    return co::DoSecondarySingleScopeScan(c, loc, scope_name, end_time);
+  return py::truth(py::call(ov, loc, scope_name, py::floating(end_time)));
+}
+void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority) {
+  py::Ref ov;
+  if (own(c, "_CScanCoordinator__AddImportEquivsToQueue", m___AddImportEquivsToQueue, ov))
+    return co::AddImportEquivsToQueue(c, imported_equivs, dirloc, priority);
+  py::call(ov, imported_equivs, dirloc, priority);
+}
+void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item) {
+  py::Ref ov;
+  if (own(c, "_WaitForScannerToBeReady", m__WaitForScannerToBeReady, ov))
+    return co::WaitForScannerToBeReady(c, scanner, scan_item);
+  py::call(ov, scanner, scan_item);
+}
+void BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
+  py::Ref meth = py::getattr(self_of(c), "BuildInstanceScopeNoScanning");
+  py::call(meth, loc, scope_name, py::floating(end_time));
 }
 
 } // namespace co::call

@@ -18,7 +18,6 @@
 #include "host/usageordereddict_capi.h"
 
 #include <chrono>
-#include <cstring>
 
 namespace uod {
 namespace {

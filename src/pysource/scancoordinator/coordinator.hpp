@@ -164,6 +164,17 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
 Ref GetModtimeDict(C *c, Borrowed loc_seq);
 void GetModtimes(C *c, Borrowed loc_seq, Borrowed completion_cb, Borrowed force);
 
+// ---- synchronous scanning ----------------------------------------------------
+bool TryToScanDictNow(C *c, Borrowed for_loc, Borrowed for_scope, Borrowed needs_scan_set,
+                      double end_time);
+Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
+                 double end_time, Borrowed do_secondary);
+Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+
+// ---- helper process (continued) -------------------------------------------
+void UpdateForHelperProcess(C *c);
+
 // ---- status and database writes -----------------------------------------
 Ref GetStatus(C *c);
 void EnsureStatusTimeout(C *c);
@@ -196,7 +207,11 @@ bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double 
 // Plain methods that the coordinator reaches through attribute lookup.
 void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority);
 void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item);
-void BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
+                 double end_time, Borrowed do_secondary);
+Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time);
+void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set);
 } // namespace call
 
 } // namespace scancoord::co

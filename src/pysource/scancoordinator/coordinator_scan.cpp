@@ -73,13 +73,6 @@ Ref one_pair_list(Borrowed a, Borrowed b) {
   return list;
 }
 
-// Text of an import equivalent given as text or as UTF-8 bytes.
-Ref as_text(Borrowed v) {
-  if (PyBytes_Check(v.get()))
-    return py::check(PyUnicode_FromEncodedObject(v.get(), "utf-8", "strict"));
-  return v.ref();
-}
-
 } // namespace
 
 bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
@@ -184,23 +177,11 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     Ref import_prefix = py::getattr(symbolinfo, "kImportPrefix");
     Ref from_prefix = py::getattr(symbolinfo, "kFromImportPrefix");
     Ref split = py::getattr(symbolinfo, "NonNestedSplit");
-    Ref semicolon = py::str(";");
     Ref values = py::call_method(py::getattr(info, "type_equivs"), py::interned("values"));
     py::for_each(values, [&](Borrowed value) {
-      Ref text = as_text(value);
-      py::for_each(py::call(split, text, semicolon), [&](Borrowed part_obj) {
-        Ref part = as_text(part_obj);
-        if (!PyUnicode_Check(part.get()))
-          return;
-        for (const Ref *prefix : {&import_prefix, &from_prefix}) {
-          Py_ssize_t r = PyUnicode_Tailmatch(part.get(), prefix->get(), 0, PY_SSIZE_T_MAX, -1);
-          if (r < 0)
-            py::throw_error();
-          if (r) {
-            py::list_append(imported, part);
-            return;
-          }
-        }
+      py::for_each(py::call(split, value, like(value, ";")), [&](Borrowed part) {
+        if (starts_with(part, import_prefix) || starts_with(part, from_prefix))
+          py::list_append(imported, part);
       });
     });
   }

@@ -235,6 +235,53 @@ SC_METHOD(_CB_WriteToDatabase) {
     return none();
   })
 }
+SC_METHOD(TryToScanDictNow) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("TryToScanDictNow", 4, "for_loc", "for_scope", "needs_scan_set", "end_time");
+    double end_time = PyFloat_AsDouble(a[3]);
+    if (end_time == -1.0 && PyErr_Occurred())
+      return nullptr;
+    return boolean(co::TryToScanDictNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time));
+  })
+}
+SC_METHOD(TryToScanNow) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("TryToScanNow", 4, "loc", "scope_name", "scan_name_list", "end_time",
+            "do_secondary");
+    double end_time = PyFloat_AsDouble(a[3]);
+    if (end_time == -1.0 && PyErr_Occurred())
+      return nullptr;
+    return co::TryToScanNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time,
+                            a[4] ? arg(a[4]) : py::Borrowed(Py_True))
+        .release();
+  })
+}
+SC_METHOD(_TryToScanInstanceScopeNow) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("_TryToScanInstanceScopeNow", 3, "loc", "scope_name", "end_time");
+    double end_time = PyFloat_AsDouble(a[2]);
+    if (end_time == -1.0 && PyErr_Occurred())
+      return nullptr;
+    return co::TryToScanInstanceScopeNow(ready(self), arg(a[0]), arg(a[1]), end_time).release();
+  })
+}
+SC_METHOD(BuildInstanceScopeNoScanning) {
+  PY_GUARD(nullptr, {
+    SC_ARGS("BuildInstanceScopeNoScanning", 3, "loc", "scope_name", "end_time");
+    double end_time = PyFloat_AsDouble(a[2]);
+    if (end_time == -1.0 && PyErr_Occurred())
+      return nullptr;
+    return co::BuildInstanceScopeNoScanning(ready(self), arg(a[0]), arg(a[1]), end_time)
+        .release();
+  })
+}
+SC_METHOD(_UpdateForHelperProcess) {
+  PY_GUARD(nullptr, {
+    SC_NOARGS("_UpdateForHelperProcess");
+    co::UpdateForHelperProcess(ready(self));
+    return none();
+  })
+}
 SC_METHOD(_CB_DoIdleAnalysis) {
   PY_GUARD(nullptr, {
     SC_NOARGS("_CB_DoIdleAnalysis");
@@ -358,6 +405,11 @@ PyMethodDef methods[] = {
     SC_DEF(RemoveLocationsFromQueue, nullptr),
     SC_DEF(FlushQueue, nullptr),
     SC_DEF(ClearLastScanInfo, nullptr),
+    SC_DEF(TryToScanDictNow, nullptr),
+    SC_DEF(TryToScanNow, nullptr),
+    SC_DEF(_TryToScanInstanceScopeNow, nullptr),
+    SC_DEF(BuildInstanceScopeNoScanning, nullptr),
+    SC_DEF(_UpdateForHelperProcess, nullptr),
     SC_DEF(_CB_DoIdleAnalysis, "Do analysis on individual lines in background mode."),
     SC_PRIVATE(__DoScans, "Do idle scans until time() > end_time."),
     SC_PRIVATE(__CheckWholeFiles,
@@ -639,9 +691,30 @@ void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item) {
     return co::WaitForScannerToBeReady(c, scanner, scan_item);
   py::call(ov, scanner, scan_item);
 }
-void BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
-  py::Ref meth = py::getattr(self_of(c), "BuildInstanceScopeNoScanning");
-  py::call(meth, loc, scope_name, py::floating(end_time));
+py::Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
+  py::Ref ov;
+  if (own(c, "BuildInstanceScopeNoScanning", m_BuildInstanceScopeNoScanning, ov))
+    return co::BuildInstanceScopeNoScanning(c, loc, scope_name, end_time);
+  return py::call(ov, loc, scope_name, py::floating(end_time));
+}
+py::Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
+                     double end_time, Borrowed do_secondary) {
+  py::Ref ov;
+  if (own(c, "TryToScanNow", m_TryToScanNow, ov))
+    return co::TryToScanNow(c, loc, scope_name, scan_name_list, end_time, do_secondary);
+  return py::call(ov, loc, scope_name, scan_name_list, py::floating(end_time));
+}
+py::Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
+  py::Ref ov;
+  if (own(c, "_TryToScanInstanceScopeNow", m__TryToScanInstanceScopeNow, ov))
+    return co::TryToScanInstanceScopeNow(c, loc, scope_name, end_time);
+  return py::call(ov, loc, scope_name, py::floating(end_time));
+}
+void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
+  py::Ref ov;
+  if (own(c, "AddNeedsScanSetToQueues", m_AddNeedsScanSetToQueues, ov))
+    return co::AddNeedsScanSetToQueues(c, needs_scan_set);
+  py::call(ov, needs_scan_set);
 }
 
 } // namespace co::call

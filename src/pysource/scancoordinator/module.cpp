@@ -157,6 +157,8 @@ void exec_body(py::Borrowed module) {
   st->defaultdict = py::getattr(m->collections, "defaultdict");
   st->int_type = py::Ref::borrow(reinterpret_cast<PyObject *>(&PyLong_Type));
   st->kWildcardScope = py::getattr(m->symbolinfo, "kWildcardScope");
+  st->not_found_result = py::check(Py_BuildValue("(OOO)", Py_False, Py_None, Py_None));
+  st->waiting_result = py::check(Py_BuildValue("(OOO)", Py_True, Py_None, Py_None));
   state = st;
 
   // 4. CScanItem
@@ -396,6 +398,36 @@ void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
   }
   for (Py_ssize_t i = 0; i < n; ++i)
     out[i] = py::Ref::borrow(PyTuple_GET_ITEM(o, i));
+}
+
+bool starts_with(py::Borrowed s, py::Borrowed prefix) {
+  py::Ref p = prefix.ref();
+  if (PyBytes_Check(s.get())) {
+    if (PyUnicode_Check(p.get()))
+      p = py::check(PyUnicode_AsUTF8String(p.get()));
+    if (!PyBytes_Check(p.get()))
+      return false;
+    const Py_ssize_t n = PyBytes_GET_SIZE(p.get());
+    return PyBytes_GET_SIZE(s.get()) >= n &&
+           std::memcmp(PyBytes_AS_STRING(s.get()), PyBytes_AS_STRING(p.get()), n) == 0;
+  }
+  if (PyUnicode_Check(s.get())) {
+    if (PyBytes_Check(p.get()))
+      p = py::check(PyUnicode_FromEncodedObject(p.get(), "utf-8", "strict"));
+    if (!PyUnicode_Check(p.get()))
+      return false;
+    Py_ssize_t r = PyUnicode_Tailmatch(s.get(), p.get(), 0, PY_SSIZE_T_MAX, -1);
+    if (r < 0)
+      py::throw_error();
+    return r != 0;
+  }
+  return false;
+}
+
+py::Ref like(py::Borrowed s, const char *ascii) {
+  if (PyBytes_Check(s.get()))
+    return py::check(PyBytes_FromString(ascii));
+  return py::str(ascii);
 }
 
 long long as_int64(py::Borrowed o) {

@@ -27,6 +27,8 @@ struct State {
   py::Ref kWildcardScope;          // symbolinfo.kWildcardScope ('*')
   py::Ref empty_item;              // CScanItem(None, None, None, None)
   py::Ref priorities[3];           // the three published priority ints
+  py::Ref not_found_result;        // (False, None, None), shared
+  py::Ref waiting_result;          // (True, None, None), shared
   PyTypeObject *SingleQueueType = nullptr;
   PyTypeObject *ScanQueueType = nullptr;
   PyTypeObject *CoordinatorType = nullptr;
@@ -95,6 +97,12 @@ void unpack(py::Borrowed seq, Py_ssize_t n, py::Ref *out);
 // Unpack a value that must be exactly a tuple (TypeError "Expected tuple,
 // got X" otherwise).
 void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out);
+
+// Text/bytes helpers for the host's equivalence strings, which may be either.
+// `starts_with` compares in the type of `s`, converting `prefix` (UTF-8) when
+// the two differ; `like(s, ascii)` is `ascii` as str or bytes to match `s`.
+bool starts_with(py::Borrowed s, py::Borrowed prefix);
+py::Ref like(py::Borrowed s, const char *ascii);
 
 // A signed 64-bit machine integer from a Python object (TypeError for
 // non-integers, OverflowError when it does not fit).

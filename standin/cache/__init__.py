@@ -1,0 +1,1 @@
+"""Text buffers and the application's cache, savable, file attribute and preference managers."""

@@ -1,0 +1,1 @@
+"""Editor documents and the GUI manager that tracks them."""

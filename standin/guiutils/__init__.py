@@ -1,0 +1,1 @@
+"""GUI toolkit wrappers: the main loop with idle and timeout sources."""

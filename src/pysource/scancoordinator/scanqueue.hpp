@@ -85,6 +85,26 @@ void LocationAdded(Q *q, Borrowed loc);
 void LocationRemoved(Q *q, Borrowed loc);
 void SignalEmitIdle(Q *q);
 
+// ---- overridable dispatch ------------------------------------------------
+// The queue's own calls of these operations go through here: a direct C++
+// call for the class itself, the override on a subclass that has one.
+namespace call {
+void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
+                  bool add_to_check);
+void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
+                       bool add_to_check);
+bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                      bool remove_waiting, Borrowed key);
+Ref FirstOrNone(Q *q);
+void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set);
+void LocationAdded(Q *q, Borrowed loc);
+void LocationRemoved(Q *q, Borrowed loc);
+Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority);
+bool IsTreeBranchReady(Q *q, Borrowed loc);
+void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_priority);
+void Clear(Q *q);
+} // namespace call
+
 // ---- shared helpers ------------------------------------------------------
 // The (counts, pending) pair stored for a location; both empty if absent.
 struct LocInfo {

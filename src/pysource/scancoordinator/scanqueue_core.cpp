@@ -260,7 +260,7 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
       unpack_tuple(pair, 2, lp);
       if (!q->f.fAnyAsyncInspectLocation && host::locations::IsAsyncInspectLocation(lp[0]))
         q->f.fAnyAsyncInspectLocation = true;
-      if (IsTreeBranchReady(q, lp[0])) {
+      if (call::IsTreeBranchReady(q, lp[0])) {
         ready.emplace_back(std::move(lp[0]), std::move(lp[1]));
       } else {
         Ref item = make_scan_item(lp[0], lp[1], scan_name, prio);
@@ -276,7 +276,7 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
       PyObject *type, *value, *tb;
       PyErr_Fetch(&type, &value, &tb);
       try {
-        AddReadyScanPairs(q, ready, scan_name, prio, add_to_check);
+        call::AddReadyScanPairs(q, ready, scan_name, prio, add_to_check);
       } catch (const py::PyError &) {
         PyErr_Clear();
       }
@@ -286,14 +286,14 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
   }
   if (ready.empty())
     return;
-  AddReadyScanPairs(q, ready, scan_name, prio, add_to_check);
+  call::AddReadyScanPairs(q, ready, scan_name, prio, add_to_check);
 }
 
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check) {
   const long long p = as_int64(priority);
   Ref prio = priority_obj(p);
-  Ref sq_obj = GetSingleQueue(q, scan_name, p);
+  Ref sq_obj = call::GetSingleQueue(q, scan_name, p);
   SingleQueueObject *sq = as_single_queue(sq_obj.get());
   Ref uod = sq->f.fOrderedDict;
   Ref wild_key; // ('*', scan_name), built on first use
@@ -309,7 +309,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     Ref existing = info ? py::dict_get(info.pending, key) : find_waiting_priority(q, loc);
     if (existing) {
       if (as_int64(existing) > p) {
-        RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
+        call::RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
         info = loc_info(q, loc); // the removal may have dropped the entry
       } else {
         continue;
@@ -377,7 +377,7 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
     info.pending = py::new_dict();
     info.tuple = py::check(PyTuple_Pack(2, info.counts.get(), info.pending.get()));
     py::dict_set(q->f._fPerLocationInfo, loc, info.tuple);
-    LocationAdded(q, loc);
+    call::LocationAdded(q, loc);
   }
   if (state->debug && py::dict_contains(info.pending, k))
     assertion_failed();
@@ -421,7 +421,7 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   py::dict_del(info.pending, k);
   if (PyDict_GET_SIZE(info.pending.get()) == 0) {
     py::dict_del(q->f._fPerLocationInfo, loc);
-    LocationRemoved(q, loc);
+    call::LocationRemoved(q, loc);
   }
   Ref old = py::dict_get(info.counts, scan_name);
   const long long per_loc = (old ? py::as_ll(old) : 0) - 1;
@@ -491,7 +491,7 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   }
   if (!RemoveScanFromPerLocationMap(q, loc, scope, scan_name, prio, key))
     return false;
-  Ref sq_obj = GetSingleQueue(q, scan_name, as_int64(prio));
+  Ref sq_obj = call::GetSingleQueue(q, scan_name, as_int64(prio));
   SingleQueueObject *sq = as_single_queue(sq_obj.get());
   Ref uod = sq->f.fOrderedDict;
   Ref name_list = om::get(uod, loc);
@@ -533,7 +533,7 @@ void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool 
           take = r != 0;
         }
         if (take)
-          RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first);
+          call::RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first);
         else
           kept = true;
       }
@@ -559,7 +559,7 @@ void Clear(Q *q) {
   PyDict_Clear(f._fWaitingForInspectByLoc.get());
   PyDict_Clear(f._fCompletedCount.get());
   PyDict_Clear(f._fWholeFilesToCheck.get());
-  UpdatePendingSets(q, Borrowed(), removed);
+  call::UpdatePendingSets(q, Borrowed(), removed);
   f.fAnyAsyncInspectLocation = false;
 }
 
@@ -572,13 +572,13 @@ void ScanCompleted(Q *q, Borrowed scan_item) {
   Ref one = py::integer(1);
   Ref now = old ? py::check(PyNumber_Add(old.get(), one.get())) : one;
   py::dict_set(counts, key, now);
-  RemoveScanTriple(q, loc, scope, scan_name, priority, true, Borrowed());
+  call::RemoveScanTriple(q, loc, scope, scan_name, priority, true, Borrowed());
 }
 
 void destroy_impl(Q *q) {
   if (!q->f.initialised)
     return;
-  Clear(q);
+  call::Clear(q);
   Ref idle = q->f._fSignalEmitIdle;
   if (idle && !idle.is_none())
     host::mainloop::idle_remove(idle);

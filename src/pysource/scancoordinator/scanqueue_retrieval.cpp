@@ -28,8 +28,8 @@ Ref FirstOrNone(Q *q) {
     Ref loc, name_list;
     if (!om::first(uod, loc, name_list))
       continue;
-    if (!IsTreeBranchReady(q, loc)) {
-      MoveScansForLocToWaitingForInspect(q, loc, Borrowed());
+    if (!call::IsTreeBranchReady(q, loc)) {
+      call::MoveScansForLocToWaitingForInspect(q, loc, Borrowed());
       if (state->debug) {
         Ref loc2, list2;
         if (om::first(uod, loc2, list2) && loc2.get() == loc.get() &&
@@ -53,7 +53,7 @@ Ref FirstOrNone(Q *q) {
 
 Ref First(Q *q) {
   for (;;) {
-    Ref item = FirstOrNone(q);
+    Ref item = call::FirstOrNone(q);
     if (item)
       return item;
   }
@@ -74,10 +74,10 @@ Ref PopWholeFilesToCheck(Q *q, Py_ssize_t max_files) {
     Ref pair = Ref::borrow(PyList_GET_ITEM(result.get(), i));
     Ref parts[2];
     unpack(pair, 2, parts);
-    if (IsTreeBranchReady(q, parts[0]))
+    if (call::IsTreeBranchReady(q, parts[0]))
       py::list_append(ready, pair);
     else
-      MoveScansForLocToWaitingForInspect(q, parts[0], parts[1]);
+      call::MoveScansForLocToWaitingForInspect(q, parts[0], parts[1]);
   }
   return ready;
 }
@@ -190,11 +190,11 @@ void UpdateForVisibleDocuments(Q *q, Borrowed active_loc, Borrowed visible_locs)
       if (seen)
         continue;
       handled.emplace_back(scan_name, prio);
-      Ref sq_obj = GetSingleQueue(q, scan_name, prio);
+      Ref sq_obj = call::GetSingleQueue(q, scan_name, prio);
       if (prio <= interactive) {
         om::get(as_single_queue(sq_obj.get())->f.fOrderedDict, loc, true);
       } else {
-        Ref to = GetSingleQueue(q, scan_name, interactive);
+        Ref to = call::GetSingleQueue(q, scan_name, interactive);
         MoveScansBetweenQueues(q, loc, Borrowed(Py_None), sq_obj, to);
       }
     }

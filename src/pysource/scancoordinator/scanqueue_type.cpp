@@ -450,7 +450,121 @@ PyType_Slot slots[] = {{Py_tp_doc, const_cast<char *>(kDoc)},
 PyType_Spec spec = {"pysource.scancoordinator._CScanQueue", sizeof(Obj), 0,
                     Py_TPFLAGS_DEFAULT | Py_TPFLAGS_BASETYPE | Py_TPFLAGS_HAVE_GC, slots};
 
+// ---- dispatch ------------------------------------------------------------
+
+using Fast = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyObject *);
+
+bool own(Q *q, const char *name, Fast fn, py::Ref &override_out) {
+  PyObject *self = reinterpret_cast<PyObject *>(q);
+  if (Py_TYPE(self) == state->ScanQueueType)
+    return true;
+  py::Ref meth = py::getattr(py::Borrowed(self), name);
+  if (PyCFunction_Check(meth.get()) &&
+      reinterpret_cast<void (*)()>(PyCFunction_GET_FUNCTION(meth.get())) ==
+          reinterpret_cast<void (*)()>(fn) &&
+      PyCFunction_GET_SELF(meth.get()) == self)
+    return true;
+  override_out = std::move(meth);
+  return false;
+}
+
+py::Ref pair_list(const sq::PairList &pairs) {
+  py::Ref list = py::check(PyList_New(static_cast<Py_ssize_t>(pairs.size())));
+  for (size_t i = 0; i < pairs.size(); ++i)
+    PyList_SET_ITEM(list.get(), static_cast<Py_ssize_t>(i),
+                    py::check(PyTuple_Pack(2, pairs[i].first.get(), pairs[i].second.get()))
+                        .release());
+  return list;
+}
+
+py::Borrowed pybool(bool b) { return py::Borrowed(b ? Py_True : Py_False); }
+py::Borrowed or_none_b(py::Borrowed b) { return b ? b : py::Borrowed(Py_None); }
+
 } // namespace
+
+namespace sq::call {
+using py::Borrowed;
+using py::Ref;
+
+void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
+                  bool add_to_check) {
+  py::Ref ov;
+  if (own(q, "AddScanPairs", m_AddScanPairs, ov))
+    return sq::AddScanPairs(q, pair_seq, scan_name, priority, add_to_check);
+  py::call(ov, pair_seq, scan_name, or_none_b(priority), pybool(add_to_check));
+}
+void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
+                       bool add_to_check) {
+  py::Ref ov;
+  if (own(q, "_AddReadyScanPairs", m__AddReadyScanPairs, ov))
+    return sq::AddReadyScanPairs(q, pairs, scan_name, priority, add_to_check);
+  py::call(ov, pair_list(pairs), scan_name, or_none_b(priority), pybool(add_to_check));
+}
+bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                      bool remove_waiting, Borrowed key) {
+  py::Ref ov;
+  if (own(q, "RemoveScanTriple", m_RemoveScanTriple, ov))
+    return sq::RemoveScanTriple(q, loc, scope, scan_name, priority, remove_waiting, key);
+  py::Ref triple = py::check(PyTuple_Pack(3, loc.get(), scope.get(), scan_name.get()));
+  return py::truth(py::call(ov, triple, or_none_b(priority), pybool(remove_waiting)));
+}
+Ref FirstOrNone(Q *q) {
+  py::Ref ov;
+  if (own(q, "_FirstOrNone", m__FirstOrNone, ov))
+    return sq::FirstOrNone(q);
+  py::Ref r = py::call(ov);
+  return r.is_none() ? py::Ref() : r;
+}
+void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set) {
+  py::Ref ov;
+  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+    return sq::UpdatePendingSets(q, added_set, removed_set);
+  py::call(ov, or_none_b(added_set), or_none_b(removed_set));
+}
+void LocationAdded(Q *q, Borrowed loc) {
+  py::Ref ov;
+  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+    return sq::LocationAdded(q, loc);
+  py::Ref added = py::new_set(), removed = py::new_set();
+  py::set_add(added, loc);
+  py::call(ov, added, removed);
+}
+void LocationRemoved(Q *q, Borrowed loc) {
+  py::Ref ov;
+  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+    return sq::LocationRemoved(q, loc);
+  py::Ref removed = py::new_set();
+  py::set_add(removed, loc);
+  py::call(ov, py::Borrowed(Py_None), removed);
+}
+Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
+  py::Ref ov;
+  if (own(q, "_GetSingleQueue", m__GetSingleQueue, ov))
+    return sq::GetSingleQueue(q, scan_name, priority);
+  py::Ref r = py::call(ov, scan_name, py::integer(priority));
+  as_single_queue(r.get());
+  return r;
+}
+bool IsTreeBranchReady(Q *q, Borrowed loc) {
+  py::Ref ov;
+  if (own(q, "IsTreeBranchReady", m_IsTreeBranchReady, ov))
+    return sq::IsTreeBranchReady(q, loc);
+  return py::truth(py::call(ov, loc));
+}
+void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_priority) {
+  py::Ref ov;
+  if (own(q, "_MoveScansForLocToWaitingForInspect", m__MoveScansForLocToWaitingForInspect, ov))
+    return sq::MoveScansForLocToWaitingForInspect(q, loc, check_priority);
+  py::call(ov, loc, or_none_b(check_priority));
+}
+void Clear(Q *q) {
+  py::Ref ov;
+  if (own(q, "Clear", m_Clear, ov))
+    return sq::Clear(q);
+  py::call(ov);
+}
+
+} // namespace sq::call
 
 PyTypeObject *create_scan_queue_type(py::Borrowed module) {
   py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));

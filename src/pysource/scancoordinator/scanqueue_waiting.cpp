@@ -120,14 +120,14 @@ void CB_TreeBranchesNowReady(Q *q, Borrowed, Borrowed ready_set) {
     });
   });
   for (auto &g : groups)
-    AddReadyScanPairs(q, g.pairs, g.scan_name, g.priority, g.check);
+    call::AddReadyScanPairs(q, g.pairs, g.scan_name, g.priority, g.check);
 }
 
 void StartWaitingForData(Q *q, Borrowed scan_item) {
   Ref waiting = q->f._fScanItemsWaitingForData;
   if (py::set_contains(waiting, scan_item))
     return;
-  RemoveScanTriple(q, item_field(scan_item, 0), item_field(scan_item, 1),
+  call::RemoveScanTriple(q, item_field(scan_item, 0), item_field(scan_item, 1),
                    item_field(scan_item, 2), item_field(scan_item, 3), true, Borrowed());
   py::set_add(waiting, scan_item);
 }
@@ -140,7 +140,7 @@ void FinishedWaitingForData(Q *q, Borrowed scan_item) {
   Ref pair = py::check(
       PyTuple_Pack(2, item_field(scan_item, 0).get(), item_field(scan_item, 1).get()));
   Ref seq = py::check(PyTuple_Pack(1, pair.get()));
-  AddScanPairs(q, seq, item_field(scan_item, 2), item_field(scan_item, 3), false);
+  call::AddScanPairs(q, seq, item_field(scan_item, 2), item_field(scan_item, 3), false);
 }
 
 namespace {

@@ -5,7 +5,7 @@
 namespace host::mainloop {
 
 namespace {
-py::Ref fn(py::Borrowed name) { return py::getattr(modules->ostrelgtk, name); }
+py::Ref fn(py::Borrowed name) { return py::module_attr(modules->ostrelgtk, name); }
 } // namespace
 
 py::Ref idle_add(py::Borrowed callback) { return py::call(fn(names().idle_add), callback); }

@@ -183,6 +183,21 @@ inline void setattr(Borrowed o, Borrowed name, Borrowed v) {
   check_int(PyObject_SetAttr(o.get(), name.get(), v.get()));
 }
 
+// An attribute of a module object: its namespace dictionary first (what a
+// module attribute lookup finds for any ordinary name), the full protocol
+// only when the name is not there.
+inline Ref module_attr(Borrowed module, Borrowed name) {
+  if (PyModule_CheckExact(module.get())) {
+    PyObject *dict = PyModule_GetDict(module.get()); // borrowed
+    PyObject *v = PyDict_GetItemWithError(dict, name.get());
+    if (v)
+      return Ref::borrow(v);
+    if (PyErr_Occurred())
+      throw_error();
+  }
+  return getattr(module, name);
+}
+
 // Vectorcall helpers: call(f, a, b, ...) with borrowed arguments.
 template <typename... A> Ref call(Borrowed f, A... args) {
   PyObject *argv[sizeof...(A) + 1] = {nullptr, Borrowed(args).get()...};

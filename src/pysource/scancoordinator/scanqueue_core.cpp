@@ -57,6 +57,37 @@ Ref make_count_pair(long long scans, long long locs) {
   return untrack_if_atomic(py::check(PyTuple_Pack(2, a.get(), b.get())));
 }
 
+// A location's per-name counts: collections.defaultdict(int).  Like the
+// collector does for plain dictionaries holding only atomic values, it starts
+// untracked (its factory, int, and its str -> int entries can never be part
+// of a cycle); storing a GC-tracked key or value re-tracks it, as for any
+// dictionary.  Untracked, the (counts, pending) pair stays untracked too, so
+// the queue's per-location records cost the cyclic GC nothing.
+Ref new_counts_dict() {
+  Ref d = py::call(state->defaultdict, state->int_type);
+  if (PyObject_GC_IsTracked(d.get()) && PyDict_GET_SIZE(d.get()) == 0)
+    PyObject_GC_UnTrack(d.get());
+  return d;
+}
+
+// _fPerScanNameCounts[scan_name] = (scans, locs).  When the stored pair is
+// referenced by that dictionary alone (and the caller's `pair`), nobody can
+// observe it, so its items are replaced in place instead of allocating a new
+// tuple for every queued scan.
+void store_count_pair(Q *q, Borrowed scan_name, Ref &pair, long long scans, long long locs) {
+  if (pair && PyTuple_CheckExact(pair.get()) && PyTuple_GET_SIZE(pair.get()) == 2 &&
+      Py_REFCNT(pair.get()) == 2) {
+    Ref a = py::integer(scans), b = py::integer(locs);
+    PyObject *t = pair.get();
+    // The tuple's old items are adopted and released once it is consistent.
+    Ref old0 = Ref::steal(PyTuple_GET_ITEM(t, 0)), old1 = Ref::steal(PyTuple_GET_ITEM(t, 1));
+    PyTuple_SET_ITEM(t, 0, a.release());
+    PyTuple_SET_ITEM(t, 1, b.release());
+    return;
+  }
+  py::dict_set(q->f._fPerScanNameCounts, scan_name, make_count_pair(scans, locs));
+}
+
 void write_scan_without_order(Borrowed scan_name) {
   Ref text = py::check(PyUnicode_FromFormat("%s%S\n", msg::kScanWithoutOrder, scan_name.get()));
   PyObject *out = PySys_GetObject("stdout"); // borrowed
@@ -373,15 +404,23 @@ namespace {
 void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
                              Borrowed k, LocInfo &info) {
   if (!info) {
-    info.counts = py::call(state->defaultdict, state->int_type);
+    info.counts = new_counts_dict();
     info.pending = py::new_dict();
-    info.tuple = py::check(PyTuple_Pack(2, info.counts.get(), info.pending.get()));
+    info.tuple =
+        untrack_if_atomic(py::check(PyTuple_Pack(2, info.counts.get(), info.pending.get())));
     py::dict_set(q->f._fPerLocationInfo, loc, info.tuple);
     call::LocationAdded(q, loc);
   }
-  if (state->debug && py::dict_contains(info.pending, k))
-    assertion_failed();
-  py::dict_set(info.pending, k, priority);
+  if (state->debug) {
+    // One lookup for both the invariant check and the store.
+    PyObject *stored = PyDict_SetDefault(info.pending.get(), k.get(), priority.get());
+    if (!stored)
+      py::throw_error();
+    if (stored != priority.get())
+      assertion_failed();
+  } else {
+    py::dict_set(info.pending, k, priority);
+  }
 
   Ref old = py::dict_get(info.counts, scan_name);
   const long long per_loc = (old ? py::as_ll(old) : 0) + 1;
@@ -396,7 +435,7 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
     locs += 1;
   if (state->debug && scans < locs)
     assertion_failed();
-  py::dict_set(q->f._fPerScanNameCounts, scan_name, make_count_pair(scans, locs));
+  store_count_pair(q, scan_name, pair, scans, locs);
 }
 } // namespace
 
@@ -448,7 +487,7 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   } else {
     if (state->debug && scans < locs)
       assertion_failed();
-    py::dict_set(q->f._fPerScanNameCounts, scan_name, make_count_pair(scans, locs));
+    store_count_pair(q, scan_name, pair, scans, locs);
   }
   return true;
 }

@@ -1,93 +1,95 @@
-"""The main job: load the scan coordinator module in the stand-in host and run
-the queueing side of a scan over a directory of Python files.
+"""The main job: scan a directory of Python files through the scan coordinator,
+driven by the stand-in host application's main loop.
 
-    ./run scan [DIR]
+    ./run scan [DIR] [--db FILE] [--no-follow-stdlib] [--idle-priority N] [--quiet]
 
-Prints what the module publishes, then queues every Python file under DIR as a
-whole-file primary scan at background priority (the road a parseable file takes
-into the queue), shows the queue, and hands the scans out in order until the
-queue is empty, as the idle loop will.  Scanning itself (parsing and storing
-scope information) runs through the coordinator, which later work adds.
+The host application is assembled for DIR (singletons, analysis manager,
+information cache, location data cache), the coordinator is created, every
+file under DIR is reported as parseable (AddParseablesToQueue), and the main
+loop runs until the coordinator's idle callback ends with empty queues: whole
+files are checked against their modification times, primary and derived scans
+run in time slices, imported modules are followed, a status report arrives
+every second, and the information cache writes its database at the end.
+Running it again over the same DIR reuses its database (kept under
+build/scan-db) and skips files that have not changed.
 """
 
+import argparse
 import os
 import sys
 import time
 from pathlib import Path
 
+import hostapp
 import pysource.scancoordinator as sc
 from guiutils import ostrelgtk
-from ostrelbase import destroyable, location
-
-PRIMARY, DERIVED = "primary", "derived"
-
-
-class LocalDataCache(destroyable.CDestroyable):
-    """Location data cache for a local project: every location is ready."""
-
-    def __init__(self):
-        super().__init__(("now-tree-branch-ready", "inspect-failed", "cleared"))
-
-    def TreeBranchReady(self, loc, flag):
-        return True
-
-
-def published():
-    names = sorted(n for n in vars(sc) if not n.startswith("__"))
-    print(f"module {sc.__name__} ({Path(sc.__file__).name})")
-    for name in names:
-        value = getattr(sc, name)
-        if isinstance(value, type):
-            kind = "class" if not hasattr(value, "_fields") else f"record {value._fields}"
-            print(f"  {name:24} {kind}")
-        elif isinstance(value, int):
-            print(f"  {name:24} = {value}")
-        elif callable(value):
-            print(f"  {name:24} function")
 
 
 def main(argv):
-    root = Path(argv[0] if argv else Path(__file__).resolve().parent.parent / "standin")
+    parser = argparse.ArgumentParser(prog="./run scan")
+    default_dir = Path(__file__).resolve().parent.parent / "standin"
+    parser.add_argument("dir", nargs="?", default=str(default_dir))
+    parser.add_argument("--db", help="database file (default: build/scan-db/<DIR>.sqlite)")
+    parser.add_argument("--no-follow-stdlib", action="store_true",
+                        help="put only DIR on the Python path")
+    parser.add_argument("--idle-priority", type=int, default=ostrelgtk.PRIORITY_DEFAULT_IDLE)
+    parser.add_argument("--quiet", action="store_true")
+    args = parser.parse_args(argv)
+
+    root = Path(args.dir).resolve()
     if not root.is_dir():
         print(f"scan: not a directory: {root}", file=sys.stderr)
         return 2
-    published()
-    files = sorted(p for p in root.rglob("*.py") if p.is_file())
-    print(f"\n{len(files)} Python files under {root}")
-    locs = [location.CreateFromName(os.fspath(p)) for p in files]
+    if args.db:
+        db = args.db
+    else:
+        db_dir = Path(__file__).resolve().parent.parent / "build" / "scan-db"
+        db_dir.mkdir(parents=True, exist_ok=True)
+        db = str(db_dir / (str(root).strip("/").replace("/", "_") + ".sqlite"))
+    python_path = [str(root)] if args.no_follow_stdlib else None
+    app = hostapp.CreateApplication(str(root), db_path=db, python_path=python_path)
+    coord = hostapp.CreateScanCoordinator(app, args.idle_priority)
+    files = app.ProjectFiles()
+    print(f"{sc.__name__}: scanning {len(files)} files under {root}")
 
-    queue = sc._CScanQueue(LocalDataCache())
-    queue.SetScansToOrder({PRIMARY: 0, DERIVED: 1})
-    added = []
-    queue.connect("locations-added", lambda q, locs: added.append(len(locs)))
-    t0 = time.perf_counter()
-    queue.AddScanPairs([(loc, "*") for loc in locs], PRIMARY, sc.kBackgroundPriority, True)
-    t_add = time.perf_counter() - t0
-    ostrelgtk.run_until_idle(max_iterations=100)
-    print(f"queued {len(locs)} whole-file scans in {t_add * 1e3:.2f} ms; "
-          f"'locations-added' reported {sum(added)} locations")
-    queue.PrintScanQueues(limit=10)
+    reports = []
 
-    checked = 0
-    while True:
-        batch = queue.PopWholeFilesToCheck()
-        if batch is None:
-            break
-        checked += len(batch)
-    order = []
-    while True:
-        item = queue.First()
-        if item.loc is None:
-            break
-        order.append(item)
-        queue.ScanCompleted(item)
-    print(f"\n{checked} files handed out for the modification-time check")
-    print(f"{len(order)} scans handed out in order; first few:")
-    for item in order[:5]:
-        print(f"  {item.scan_name} p{item.priority} {item.scope_name} {item.loc.fUrl}")
-    print(f"queue empty: {queue.Empty()}")
-    queue.destroy()
-    return 0 if len(order) == len(locs) else 1
+    def on_status(_coord, status):
+        reports.append(status)
+        if not args.quiet:
+            queued = ", ".join(f"{q.scan_name} p{q.priority}: {q.file_count}"
+                               for q in status.queue_status_list) or "nothing queued"
+            print(f"  status: {queued}; waiting {status.waiting_count}")
+
+    ends = []
+    coord.connect("scan-status-update", on_status)
+    coord.connect("end", lambda *a: ends.append(time.perf_counter()))
+
+    start = time.perf_counter()
+    coord.AddParseablesToQueue(files)
+    finished = ostrelgtk.run_until_idle(max_iterations=10_000_000)
+    elapsed = time.perf_counter() - start
+
+    completed = coord._fScanTripleCompletedCount
+    primary = app.fAnaMgr.fPrimaryScanName
+    derived = app.fAnaMgr.fDerivedScanName
+    n_primary = sum(n for (_, _, name), n in completed.items() if name == primary)
+    n_derived = sum(n for (_, _, name), n in completed.items() if name == derived)
+    scanned_files = {loc for (loc, _, _) in completed}
+    print(f"finished: {finished}; queues empty: {coord.QueuesEmpty()}; "
+          f"{elapsed:.2f} s; {len(reports)} status reports; 'end' emitted {len(ends)} times")
+    print(f"completed scans: {n_primary} primary, {n_derived} derived, "
+          f"over {len(scanned_files)} files (imports followed)")
+    in_project = sorted(str(loc.fUrl) for loc in scanned_files
+                        if str(loc.fUrl).startswith(root.as_uri()))
+    for url in in_project[:10]:
+        print(f"  {url}")
+    if len(in_project) > 10:
+        print(f"  ... and {len(in_project) - 10} more in the project")
+    if os.path.exists(db):
+        print(f"database: {db} ({os.path.getsize(db)} bytes)")
+    app.Shutdown()
+    return 0 if finished else 1
 
 
 if __name__ == "__main__":

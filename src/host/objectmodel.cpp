@@ -43,7 +43,25 @@ py::Ref connect_while_alive(py::Borrowed emitter, py::Borrowed signal, py::Borro
 }
 
 void destroy(py::Borrowed obj) {
+  // The C entry point only when obj.destroy is the base class's own method;
+  // a host class that overrides destroy() gets its override called.
+  static PyObject *base_destroy = nullptr; // borrowed from the base type's dict
+  if (!base_destroy) {
+    base_destroy = PyDict_GetItemWithError(g_api->type->tp_dict, names().destroy.get());
+    if (!base_destroy && PyErr_Occurred())
+      py::throw_error();
+  }
+  bool own_destroy = false;
   if (PyObject_TypeCheck(obj.get(), g_api->type)) {
+    if (Py_TYPE(obj.get()) == g_api->type) {
+      own_destroy = true;
+    } else {
+      py::Ref found = py::getattr(py::Borrowed(reinterpret_cast<PyObject *>(Py_TYPE(obj.get()))),
+                                  names().destroy);
+      own_destroy = found.get() == base_destroy;
+    }
+  }
+  if (own_destroy) {
     if (g_api->destroy(obj.get()) < 0)
       py::throw_error();
     return;

@@ -16,7 +16,9 @@
 #include <Python.h>
 
 #include <cstdint>
+#include <cstring>
 #include <exception>
+#include <unordered_map>
 #include <utility>
 
 namespace py {
@@ -158,7 +160,27 @@ inline void translate_exception() noexcept {
 // ---- small helpers used everywhere ---------------------------------------
 
 inline Ref str(const char *s) { return check(PyUnicode_FromString(s)); }
-inline Ref interned(const char *s) { return check(PyUnicode_InternFromString(s)); }
+
+// The interned str of a constant C string (an attribute, signal or message
+// name), created once and kept for the life of the process: hot paths look
+// names up without building a new string each time.  The cache is keyed by
+// the literal's address and checked against its text, so a reused buffer
+// can never return a stale name.  Called with the GIL held, like all of this.
+inline PyObject *intern_cached(const char *s) {
+  static auto *cache = new std::unordered_map<const char *, PyObject *>();
+  auto it = cache->find(s);
+  if (it != cache->end()) {
+    const char *text = PyUnicode_AsUTF8(it->second);
+    if (text && std::strcmp(text, s) == 0)
+      return it->second;
+  }
+  PyObject *u = PyUnicode_InternFromString(s);
+  if (!u)
+    throw_error();
+  (*cache)[s] = u; // a replaced entry stays alive: someone may still borrow it
+  return u;
+}
+inline Ref interned(const char *s) { return Ref::borrow(intern_cached(s)); }
 inline Ref integer(long long v) { return check(PyLong_FromLongLong(v)); }
 inline Ref floating(double v) { return check(PyFloat_FromDouble(v)); }
 
@@ -177,7 +199,7 @@ inline Ref getattr(Borrowed o, Borrowed name) {
   return check(PyObject_GetAttr(o.get(), name.get()));
 }
 inline Ref getattr(Borrowed o, const char *name) {
-  return check(PyObject_GetAttrString(o.get(), name));
+  return check(PyObject_GetAttr(o.get(), intern_cached(name)));
 }
 inline void setattr(Borrowed o, Borrowed name, Borrowed v) {
   check_int(PyObject_SetAttr(o.get(), name.get(), v.get()));

@@ -43,9 +43,9 @@ double now_time() {
   return duration<double>(system_clock::now().time_since_epoch()).count();
 }
 
-void log(C *c, const char *message) { py::call(c->f.fLog, py::str(message)); }
+void log(C *c, const char *message) { py::call(c->f.fLog, py::interned(message)); }
 void log(C *c, const char *format, Borrowed value) {
-  py::call(c->f.fLog, py::str(format), value);
+  py::call(c->f.fLog, py::interned(format), value);
 }
 
 namespace {
@@ -67,7 +67,7 @@ double slice_budget() {
   }
   if (!PyUnicode_Check(file.get()))
     return 0.1;
-  static Ref *so = new Ref(py::str(".so")), *pyd = new Ref(py::str(".pyd"));
+  static Ref *so = new Ref(py::interned(".so")), *pyd = new Ref(py::interned(".pyd"));
   for (Ref *suffix : {so, pyd}) {
     Py_ssize_t r = PyUnicode_Tailmatch(file.get(), suffix->get(), 0, PY_SSIZE_T_MAX, 1);
     if (r < 0)
@@ -89,7 +89,7 @@ bool is_python(C *c, Borrowed loc) {
   if (PyUnicode_Check(url.get())) {
     static const char *suffixes[] = {".py", ".pi", ".pyi"};
     for (const char *s : suffixes) {
-      Ref suffix = py::str(s);
+      Ref suffix = py::interned(s);
       Py_ssize_t r = PyUnicode_Tailmatch(url.get(), suffix.get(), 0, PY_SSIZE_T_MAX, 1);
       if (r < 0)
         py::throw_error();

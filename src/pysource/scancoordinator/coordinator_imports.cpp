@@ -93,8 +93,8 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   Ref split = py::getattr(si, "NonNestedSplit");
   Ref parent_of = py::getattr(si, "ParentScopeName");
   Ref all_dots = py::getattr(si, "AllDotsInSlice");
-  Ref semicolon = py::str(";"), colon = py::str(":"), space = py::str(" "), star = py::str("*"),
-      dot = py::str(".");
+  Ref semicolon = py::interned(";"), colon = py::interned(":"), space = py::interned(" "), star = py::interned("*"),
+      dot = py::interned(".");
 
   py::for_each(imported_equivs, [&](Borrowed value) {
     Ref text = as_text(value);
@@ -120,7 +120,7 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
         py::set_add(names, slice(eq, prefix_len, -2));
         return;
       }
-      Ref dotted = py::str("");
+      Ref dotted = py::interned("");
       if (nparts == 2 && PyUnicode_GET_LENGTH(p0.get()) && PyUnicode_GET_LENGTH(p1.get())) {
         Py_ssize_t ends = PyUnicode_Tailmatch(p0.get(), dot.get(), 0, PY_SSIZE_T_MAX, 1);
         if (ends < 0)

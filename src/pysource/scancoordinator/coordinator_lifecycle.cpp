@@ -209,7 +209,7 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   f._fPendingScanNowTriples = py::new_set();
   f.fActiveScanItem = Ref::none();
   f._fScanTripleCompletedCount = py::call(state->defaultdict, state->int_type);
-  f.fLog = py::call(py::getattr(host::modules->fastaccess, "CLogger"), py::str("IdleAnalysis"));
+  f.fLog = py::call(py::getattr(host::modules->fastaccess, "CLogger"), py::interned("IdleAnalysis"));
   f._fActiveIdleStart = -1.0;
   f._fLastLogQueue = -1.0;
   f.fWaitingForRemote = false;

@@ -184,7 +184,7 @@ bool QueueBasicModules(C *c, Borrowed) {
     py::for_each(typing, [&](Borrowed loc) { py::list_append(locs, loc); });
   Ref pairs = py::new_list();
   for (Py_ssize_t i = 0; i < PyList_GET_SIZE(locs.get()); ++i)
-    py::list_append(pairs, pair(Borrowed(PyList_GET_ITEM(locs.get(), i)), py::str("*")));
+    py::list_append(pairs, pair(Borrowed(PyList_GET_ITEM(locs.get(), i)), py::interned("*")));
   call::AddPairsToPrimaryQueue(c, pairs, Borrowed(Py_True),
                                state->priorities[kTypingModulePriority]);
   c->f._fAllBasicModuleQueued = true;

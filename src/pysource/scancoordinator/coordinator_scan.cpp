@@ -153,7 +153,7 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     scanner = new_scanner("CSingleScopePrimaryScanner", {loc.get(), scope.get()}, incomplete,
                           f.fLog);
     py::dict_set(active, key, scanner);
-    py::call(f.fLog, py::str(msgs::kStartScope), scope, loc);
+    py::call(f.fLog, py::interned(msgs::kStartScope), scope, loc);
   }
   const Outcome out = run_slice(scanner, end_time);
   if (out == Outcome::Waiting) {
@@ -165,7 +165,7 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   dict_discard(active, key);
   Ref changed =
       py::call_method(scanner, py::interned("SaveToInfoCache"), py::Borrowed(Py_False));
-  py::call(f.fLog, py::str(msgs::kFinishScope), scope, loc, changed);
+  py::call(f.fLog, py::interned(msgs::kFinishScope), scope, loc, changed);
   if (!py::truth(changed)) {
     host::objectmodel::destroy(scanner);
     return false;

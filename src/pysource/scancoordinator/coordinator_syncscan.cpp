@@ -320,7 +320,7 @@ Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double
       static Ref *kw = new Ref(py::check(PyTuple_Pack(1, py::interned("does_not_exist").get())));
       auto make = [&](Borrowed name) {
         Ref key = py::call(py::getattr(scopeinfo, "CScopeInfoKey"), loc, name, primary, loc, name);
-        Ref empty = py::str("");
+        Ref empty = py::interned("");
         PyObject *argv[] = {key.get(), empty.get(), mtime.get(), Py_False, Py_True};
         Ref info = py::call_kw(py::getattr(scopeinfo, "CScopeInfo"), argv, 4, *kw);
         py::call_method(info_cache, *s_add, info);

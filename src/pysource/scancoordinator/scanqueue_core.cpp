@@ -510,8 +510,16 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
             to_remove.push_back(item.ref());
         });
       }
-      for (auto &item : to_remove)
-        py::set_discard(item_set, item);
+      // set.difference_update, not one discard per item: it also compacts a
+      // table left with many dummies, and that decides the set's later
+      // iteration order (which decides the order parked work is re-queued).
+      {
+        Ref removal = py::new_list();
+        for (auto &item : to_remove)
+          py::list_append(removal, item);
+        static Ref *s_difference_update = new Ref(py::interned("difference_update"));
+        py::call_method(item_set, *s_difference_update, removal);
+      }
       if (PyObject_Size(item_set.get()) == 0) {
         if (PyErr_Occurred())
           py::throw_error();

@@ -325,7 +325,7 @@ Py_ssize_t write_for_loc(Borrowed write, Borrowed loc, Borrowed name_list, Py_ss
       break;
     }
     if (count >= loc_limit) {
-      write_text(write, py::str("    ...\n"));
+      write_text(write, py::interned("    ...\n"));
       break;
     }
     write_fmt(write, "    %U\n", fmt(name));
@@ -342,7 +342,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     write = py::getattr(py::getattr(host::modules->sys, "stdout"), host::names().write);
   else
     write = write_arg.ref();
-  write_text(write, py::str("_CScanQueue contents:\n"));
+  write_text(write, py::interned("_CScanQueue contents:\n"));
   Py_ssize_t count = 0;
   Ref queues = py::check(
       PyList_GetSlice(q->f._fOrderedQueues.get(), 0, PyList_GET_SIZE(q->f._fOrderedQueues.get())));
@@ -364,7 +364,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
           break;
         }
         if (count >= limit) {
-          write_text(write, py::str("  ...\n"));
+          write_text(write, py::interned("  ...\n"));
           break;
         }
         Ref parts[2];
@@ -372,7 +372,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
         count += write_for_loc(write, parts[0], parts[1], limit - count);
       }
     } else {
-      write_text(write, py::str("  ...\n"));
+      write_text(write, py::interned("  ...\n"));
     }
   }
   Ref waiting = q->f._fWaitingForInspectByLoc;
@@ -385,7 +385,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
       write_fmt(write, "  File: %U\n",
                 py::check(PyObject_Repr(PyList_GET_ITEM(keys.get(), i))));
     if (nwait >= limit)
-      write_text(write, py::str("  ...\n"));
+      write_text(write, py::interned("  ...\n"));
   }
   Ref data = q->f._fScanItemsWaitingForData;
   Py_ssize_t ndata = PySet_GET_SIZE(data.get());
@@ -397,7 +397,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
       write_fmt(write, "  Scan: %U\n",
                 py::check(PyObject_Repr(PyList_GET_ITEM(items.get(), i))));
     if (ndata >= limit)
-      write_text(write, py::str("  ...\n"));
+      write_text(write, py::interned("  ...\n"));
   }
 }
 

@@ -12,3 +12,8 @@ _ext = os.environ.get("PYSOURCE_EXT_DIR", str(ROOT / "build" / "ext"))
 for p in (str(ROOT / "standin"), _ext, str(ROOT / "tests")):
     if p not in sys.path:
         sys.path.insert(0 if p.endswith("standin") else len(sys.path), p)
+
+import pytest  # noqa: E402
+
+# Shared fixture and double modules get pytest's assertion rewriting too.
+pytest.register_assert_rewrite("scanqueue_fixtures", "coord_doubles", "scan_doubles")

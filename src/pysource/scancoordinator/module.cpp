@@ -383,6 +383,11 @@ void unpack(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
 }
 
 void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
+  if (seq.is_none()) {
+    // A tuple-typed value may be None; unpacking it is what fails.
+    PyErr_SetString(PyExc_TypeError, msg::kNoneNotIterable);
+    py::throw_error();
+  }
   if (!PyTuple_Check(seq.get())) {
     PyErr_Format(PyExc_TypeError, msg::kExpectedType, "tuple", Py_TYPE(seq.get())->tp_name);
     py::throw_error();

@@ -77,6 +77,7 @@ constexpr const char *kDuplicateKeyword = "%s() got multiple values for keyword 
 constexpr const char *kTooManyValues = "too many values to unpack (expected %zd)";
 constexpr const char *kNotEnoughValues = "not enough values to unpack (expected %zd, got %zd)";
 constexpr const char *kNotReached = "should not be reached";
+constexpr const char *kNoneNotIterable = "'NoneType' object is not iterable";
 constexpr const char *kScanWithoutOrder = "Scan without order: ";
 constexpr const char *kReinit =
     "Module 'scancoordinator' has already been imported. Re-initialisation is not supported.";

@@ -4,9 +4,7 @@
 namespace host::anamgr {
 
 namespace {
-py::Ref attr(py::Borrowed o, const char *name) {
-  return py::getattr(o, py::interned(name));
-}
+py::Ref attr(py::Borrowed o, const char *name) { return py::getattr(o, py::interned(name)); }
 } // namespace
 
 py::Ref PrimaryScanName(py::Borrowed m) {

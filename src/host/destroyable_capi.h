@@ -24,8 +24,7 @@ extern "C" {
 #define CDESTROYABLE_ABI_VERSION 1u
 
 typedef struct {
-  PyObject_HEAD
-  PyObject *weakreflist;
+  PyObject_HEAD PyObject *weakreflist;
   /* tuple of the signal names this instance may emit (given to __init__) */
   PyObject *declared_signals;
   /* dict: signal name -> list of connections; NULL until the first connect */

@@ -4,9 +4,7 @@
 
 namespace host::gui {
 
-py::Ref GetSingletons() {
-  return py::call(py::getattr(modules->singleton, names().GetSingletons));
-}
+py::Ref GetSingletons() { return py::call(py::getattr(modules->singleton, names().GetSingletons)); }
 
 py::Ref ActiveSourceEditorLocation(py::Borrowed gui_mgr) {
   // from edit import editor

@@ -149,12 +149,12 @@ inline void translate_exception() noexcept {
 
 // Wrap the body of a function called from Python.  `fail` is the value to
 // return when an exception is pending (nullptr, -1, ...).
-#define PY_GUARD(fail, ...)                                                    \
-  try {                                                                        \
-    __VA_ARGS__                                                                \
-  } catch (...) {                                                              \
-    ::py::translate_exception();                                               \
-    return fail;                                                               \
+#define PY_GUARD(fail, ...)                                                                        \
+  try {                                                                                            \
+    __VA_ARGS__                                                                                    \
+  } catch (...) {                                                                                  \
+    ::py::translate_exception();                                                                   \
+    return fail;                                                                                   \
   }
 
 // ---- small helpers used everywhere ---------------------------------------
@@ -223,8 +223,7 @@ inline Ref module_attr(Borrowed module, Borrowed name) {
 // Vectorcall helpers: call(f, a, b, ...) with borrowed arguments.
 template <typename... A> Ref call(Borrowed f, A... args) {
   PyObject *argv[sizeof...(A) + 1] = {nullptr, Borrowed(args).get()...};
-  return check(PyObject_Vectorcall(f.get(), argv + 1,
-                                   sizeof...(A) | PY_VECTORCALL_ARGUMENTS_OFFSET,
+  return check(PyObject_Vectorcall(f.get(), argv + 1, sizeof...(A) | PY_VECTORCALL_ARGUMENTS_OFFSET,
                                    nullptr));
 }
 inline Ref call(Borrowed f) { return check(PyObject_CallNoArgs(f.get())); }

@@ -27,20 +27,20 @@ struct Fields {
   Ref fCacheMgr;
   Ref fSingletons;
   Ref _fScanQueue;
-  Ref fActiveLoc;                           // __fActiveLoc
-  Ref fActivePrimaryWholeFileScanners;      // __f...
-  Ref fActivePrimarySingleScopeScanners;    // __f...
-  Ref fActiveSecondaryWholeFileScanners;    // __f...
-  Ref fActiveSecondarySingleScopeScanners;  // __f...
+  Ref fActiveLoc;                          // __fActiveLoc
+  Ref fActivePrimaryWholeFileScanners;     // __f...
+  Ref fActivePrimarySingleScopeScanners;   // __f...
+  Ref fActiveSecondaryWholeFileScanners;   // __f...
+  Ref fActiveSecondarySingleScopeScanners; // __f...
   Ref _fIncompleteScansByLoc;
   Ref _fCompletedScanCount;
   Ref _fIdleProcId;
   Ref _fMTimeAtLastWholeFileCheck;
   long long fIdlePriority = 0;
-  Ref fCompletedLocs;                       // __fCompletedLocs
-  Ref fStatusTimeout;                       // __fStatusTimeout
+  Ref fCompletedLocs; // __fCompletedLocs
+  Ref fStatusTimeout; // __fStatusTimeout
   Ref _fLastScanCompleted;
-  bool fQuitting = false;                   // __fQuitting
+  bool fQuitting = false; // __fQuitting
   bool _fAllBasicModuleQueued = false;
   bool _fAnalyzeFoundImports = false;
   Ref _fRemoteLocationsReady;
@@ -167,8 +167,8 @@ void GetModtimes(C *c, Borrowed loc_seq, Borrowed completion_cb, Borrowed force)
 // ---- synchronous scanning ----------------------------------------------------
 bool TryToScanDictNow(C *c, Borrowed for_loc, Borrowed for_scope, Borrowed needs_scan_set,
                       double end_time);
-Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
-                 double end_time, Borrowed do_secondary);
+Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list, double end_time,
+                 Borrowed do_secondary);
 Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time);
 Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
 
@@ -208,8 +208,8 @@ bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double 
 void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority);
 void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item);
 Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time);
-Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
-                 double end_time, Borrowed do_secondary);
+Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list, double end_time,
+                 Borrowed do_secondary);
 Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time);
 void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set);
 } // namespace call

@@ -23,24 +23,28 @@ namespace {
 
 C *coord(PyObject *cell) { return reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0)); }
 
-PyObject *on_locs_removed(PyObject *cell, PyObject *locs) {
-  PY_GUARD(nullptr, {
-    Ref queued = coord(cell)->f._fLocsQueuedInHelper;
-    py::for_each(Borrowed(locs), [&](Borrowed loc) { py::set_discard(queued, loc); });
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_locs_removed(PyObject *cell, PyObject *locs){
+    PY_GUARD(nullptr,
+             {
+               Ref queued = coord(cell)->f._fLocsQueuedInHelper;
+               py::for_each(Borrowed(locs), [&](Borrowed loc) { py::set_discard(queued, loc); });
+               Py_RETURN_NONE;
+             })}
 
-PyObject *on_locs_added(PyObject *cell, PyObject *locs) {
-  PY_GUARD(nullptr, {
-    Ref queued = coord(cell)->f._fLocsQueuedInHelper;
-    py::for_each(Borrowed(locs), [&](Borrowed loc) { py::set_add(queued, loc); });
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_locs_added(PyObject *cell, PyObject *locs){
+    PY_GUARD(nullptr,
+             {
+               Ref queued = coord(cell)->f._fLocsQueuedInHelper;
+               py::for_each(Borrowed(locs), [&](Borrowed loc) { py::set_add(queued, loc); });
+               Py_RETURN_NONE;
+             })}
 
-PyMethodDef def_on_locs_removed = {"on_scan_queue_locs_removed", on_locs_removed, METH_O,
-                                   nullptr};
+PyMethodDef def_on_locs_removed = {
+  "on_scan_queue_locs_removed",
+  on_locs_removed,
+  METH_O,
+  nullptr
+};
 PyMethodDef def_on_locs_added = {"on_scan_queue_locs_added", on_locs_added, METH_O, nullptr};
 
 Ref handler(PyMethodDef *def, Borrowed self) {

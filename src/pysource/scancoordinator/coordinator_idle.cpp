@@ -60,7 +60,8 @@ bool logging_on(C *c) {
 double slice_budget() {
   if (!state->debug)
     return 0.05;
-  Ref file = py::Ref::steal(PyObject_GetAttrString(host::modules->inferenceengine.get(), "__file__"));
+  Ref file =
+      py::Ref::steal(PyObject_GetAttrString(host::modules->inferenceengine.get(), "__file__"));
   if (!file) {
     PyErr_Clear();
     return 0.1;
@@ -113,8 +114,8 @@ bool is_python(C *c, Borrowed loc) {
 void report_current_exception(Borrowed exc) {
   PyObject *previous = PyErr_GetHandledException();
   PyErr_SetHandledException(exc.get());
-  Ref report = Ref::steal(PyObject_GetAttrString(host::modules->reflect.get(),
-                                                 "ReportCurrentException"));
+  Ref report =
+      Ref::steal(PyObject_GetAttrString(host::modules->reflect.get(), "ReportCurrentException"));
   Ref result = report ? Ref::steal(PyObject_CallNoArgs(report.get())) : Ref();
   PyErr_SetHandledException(previous);
   Py_XDECREF(previous);
@@ -208,8 +209,7 @@ void DoScans(C *c, double end_time) {
     Ref item = sq::First(q);
     Ref fields[4];
     unpack(item, 4, fields);
-    const Ref &loc = fields[0], &scope = fields[1], &scan_name = fields[2],
-              &priority = fields[3];
+    const Ref &loc = fields[0], &scope = fields[1], &scan_name = fields[2], &priority = fields[3];
     if (loc.is_none()) {
       log(c, msgs::kLocIsNone);
       return;
@@ -265,8 +265,7 @@ bool CheckWholeFiles(C *c, double end_time) {
     Ref keys = py::check(PyDict_Keys(check.get()));
     Ref mtime_dict = call::GetModtimeDict(c, keys);
     if (!PyDict_Check(mtime_dict.get())) {
-      PyErr_Format(PyExc_TypeError, msg::kExpectedType, "dict",
-                   Py_TYPE(mtime_dict.get())->tp_name);
+      PyErr_Format(PyExc_TypeError, msg::kExpectedType, "dict", Py_TYPE(mtime_dict.get())->tp_name);
       py::throw_error();
     }
     Ref missing = py::new_list(), existing = py::new_dict();
@@ -289,8 +288,7 @@ bool CheckWholeFiles(C *c, double end_time) {
         py::call_method(f._fInfoCache, py::interned("GetScansDoneForMultipleFiles"), existing);
     log(c, msgs::kScansDone, scans_done);
     if (!PyDict_Check(scans_done.get())) {
-      PyErr_Format(PyExc_TypeError, msg::kExpectedType, "dict",
-                   Py_TYPE(scans_done.get())->tp_name);
+      PyErr_Format(PyExc_TypeError, msg::kExpectedType, "dict", Py_TYPE(scans_done.get())->tp_name);
       py::throw_error();
     }
     Ref up_to_date = py::new_list();

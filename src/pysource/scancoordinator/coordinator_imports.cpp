@@ -93,8 +93,8 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   Ref split = py::getattr(si, "NonNestedSplit");
   Ref parent_of = py::getattr(si, "ParentScopeName");
   Ref all_dots = py::getattr(si, "AllDotsInSlice");
-  Ref semicolon = py::interned(";"), colon = py::interned(":"), space = py::interned(" "), star = py::interned("*"),
-      dot = py::interned(".");
+  Ref semicolon = py::interned(";"), colon = py::interned(":"), space = py::interned(" "),
+      star = py::interned("*"), dot = py::interned(".");
 
   py::for_each(imported_equivs, [&](Borrowed value) {
     Ref text = as_text(value);
@@ -206,28 +206,34 @@ Ref GetModtimeDict(C *c, Borrowed loc_seq) {
 namespace {
 
 // process_modtimes(abort): bound to the cell (coordinator, loc_seq, completion_cb).
-PyObject *process_modtimes(PyObject *cell, PyObject *abort) {
-  PY_GUARD(nullptr, {
-    C *c = reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0));
-    Borrowed loc_seq(PyTuple_GET_ITEM(cell, 1));
-    Borrowed completion_cb(PyTuple_GET_ITEM(cell, 2));
-    if (py::truth(Borrowed(abort))) {
-      Ref text = py::check(PyUnicode_FromFormat("%s %S\n", kAbortMessage, loc_seq.get()));
-      PyObject *out = PySys_GetObject("stdout");
-      if (out && out != Py_None) {
-        Ref keep = Ref::borrow(out);
-        py::check_int(PyFile_WriteObject(text.get(), keep.get(), Py_PRINT_RAW));
-      }
-      Py_RETURN_NONE;
-    }
-    Ref times = modtimes_for(c, loc_seq);
-    host::objectmodel::emit(self_of(c), py::interned("modtimes-updated"), times);
-    py::call(completion_cb, times);
-    Py_RETURN_NONE;
-  })
-}
+PyObject *process_modtimes(PyObject *cell, PyObject *abort){
+    PY_GUARD(nullptr,
+             {
+               C *c = reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0));
+               Borrowed loc_seq(PyTuple_GET_ITEM(cell, 1));
+               Borrowed completion_cb(PyTuple_GET_ITEM(cell, 2));
+               if (py::truth(Borrowed(abort))) {
+                 Ref text =
+                     py::check(PyUnicode_FromFormat("%s %S\n", kAbortMessage, loc_seq.get()));
+                 PyObject *out = PySys_GetObject("stdout");
+                 if (out && out != Py_None) {
+                   Ref keep = Ref::borrow(out);
+                   py::check_int(PyFile_WriteObject(text.get(), keep.get(), Py_PRINT_RAW));
+                 }
+                 Py_RETURN_NONE;
+               }
+               Ref times = modtimes_for(c, loc_seq);
+               host::objectmodel::emit(self_of(c), py::interned("modtimes-updated"), times);
+               py::call(completion_cb, times);
+               Py_RETURN_NONE;
+             })}
 
-PyMethodDef def_process_modtimes = {"process_modtimes", process_modtimes, METH_O, nullptr};
+PyMethodDef def_process_modtimes = {
+  "process_modtimes",
+  process_modtimes,
+  METH_O,
+  nullptr
+};
 
 } // namespace
 

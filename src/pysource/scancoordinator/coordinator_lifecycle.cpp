@@ -45,48 +45,48 @@ PyObject *on_mod_cache_unsuspend(PyObject *self, PyObject *) {
   Py_RETURN_NONE;
 }
 
-PyObject *on_modified(PyObject *self, PyObject *ana) {
-  PY_GUARD(nullptr, {
-    Ref loc = py::getattr(Borrowed(ana), host::names().fLocation);
-    Ref locs = py::check(PyList_New(1));
-    PyList_SET_ITEM(locs.get(), 0, loc.release());
-    call::ClearLastScanInfo(coord(self), locs);
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_modified(PyObject *self, PyObject *ana){
+    PY_GUARD(nullptr,
+             {
+               Ref loc = py::getattr(Borrowed(ana), host::names().fLocation);
+               Ref locs = py::check(PyList_New(1));
+               PyList_SET_ITEM(locs.get(), 0, loc.release());
+               call::ClearLastScanInfo(coord(self), locs);
+               Py_RETURN_NONE;
+             })}
 
-PyObject *on_external_mod(PyObject *cell, PyObject *args) {
-  PY_GUARD(nullptr, {
-    PyObject *savable_mgr, *mod_dict;
-    if (!PyArg_UnpackTuple(args, "on_external_mod", 2, 2, &savable_mgr, &mod_dict))
-      return nullptr;
-    Ref self = Ref::borrow(PyWeakref_GetObject(PyTuple_GET_ITEM(cell, 0)));
-    if (!self || self.is_none())
-      Py_RETURN_NONE; // the coordinator is gone
-    Ref changed = py::check(PySet_New(mod_dict));
-    Ref last = reinterpret_cast<C *>(self.get())->f._fLastScanCompleted;
-    py::for_each(changed, [&](Borrowed loc) {
-      if (py::dict_contains(last, loc))
-        py::dict_del(last, loc);
-    });
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_external_mod(PyObject *cell, PyObject *args){
+    PY_GUARD(nullptr,
+             {
+               PyObject *savable_mgr, *mod_dict;
+               if (!PyArg_UnpackTuple(args, "on_external_mod", 2, 2, &savable_mgr, &mod_dict))
+                 return nullptr;
+               Ref self = Ref::borrow(PyWeakref_GetObject(PyTuple_GET_ITEM(cell, 0)));
+               if (!self || self.is_none())
+                 Py_RETURN_NONE; // the coordinator is gone
+               Ref changed = py::check(PySet_New(mod_dict));
+               Ref last = reinterpret_cast<C *>(self.get())->f._fLastScanCompleted;
+               py::for_each(changed, [&](Borrowed loc) {
+                 if (py::dict_contains(last, loc))
+                   py::dict_del(last, loc);
+               });
+               Py_RETURN_NONE;
+             })}
 
-PyObject *on_buffer_change(PyObject *self, PyObject *args) {
-  PY_GUARD(nullptr, {
-    if (PyTuple_GET_SIZE(args) < 1) {
-      PyErr_Format(PyExc_TypeError, msg::kArgCount, "on_buffer_change", "at least",
-                   static_cast<Py_ssize_t>(1), "", PyTuple_GET_SIZE(args));
-      return nullptr;
-    }
-    Ref loc = py::getattr(Borrowed(PyTuple_GET_ITEM(args, 0)), host::names().fLocation);
-    Ref last = coord(self)->f._fLastScanCompleted;
-    if (py::dict_contains(last, loc))
-      py::dict_del(last, loc);
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_buffer_change(PyObject *self, PyObject *args){
+    PY_GUARD(nullptr,
+             {
+               if (PyTuple_GET_SIZE(args) < 1) {
+                 PyErr_Format(PyExc_TypeError, msg::kArgCount, "on_buffer_change", "at least",
+                              static_cast<Py_ssize_t>(1), "", PyTuple_GET_SIZE(args));
+                 return nullptr;
+               }
+               Ref loc = py::getattr(Borrowed(PyTuple_GET_ITEM(args, 0)), host::names().fLocation);
+               Ref last = coord(self)->f._fLastScanCompleted;
+               if (py::dict_contains(last, loc))
+                 py::dict_del(last, loc);
+               Py_RETURN_NONE;
+             })}
 
 PyObject *on_server_changed(PyObject *self, PyObject *) {
   PyObject *ready = coord(self)->f._fRemoteLocationsReady.get();
@@ -95,32 +95,36 @@ PyObject *on_server_changed(PyObject *self, PyObject *) {
   Py_RETURN_NONE;
 }
 
-PyObject *on_import_resolution_changed(PyObject *self, PyObject *) {
-  PY_GUARD(nullptr, {
-    C *c = coord(self);
-    if (host::anamgr::PythonPathLength(c->f.fAnaMgr) == 0) {
-      if (c->f._fIdleProcId && !c->f._fIdleProcId.is_none()) {
-        host::mainloop::idle_remove(c->f._fIdleProcId);
-        c->f._fIdleProcId = Ref::none();
-        om::emit(self_of(c), signal_name(1));
-      }
-    } else if (!sq::Empty(queue(c), true)) {
-      call::ScheduleIdle(c);
-    }
-    Py_RETURN_NONE;
-  })
-}
+PyObject *on_import_resolution_changed(PyObject *self, PyObject *){
+    PY_GUARD(nullptr,
+             {
+               C *c = coord(self);
+               if (host::anamgr::PythonPathLength(c->f.fAnaMgr) == 0) {
+                 if (c->f._fIdleProcId && !c->f._fIdleProcId.is_none()) {
+                   host::mainloop::idle_remove(c->f._fIdleProcId);
+                   c->f._fIdleProcId = Ref::none();
+                   om::emit(self_of(c), signal_name(1));
+                 }
+               } else if (!sq::Empty(queue(c), true)) {
+                 call::ScheduleIdle(c);
+               }
+               Py_RETURN_NONE;
+             })}
 
-PyMethodDef def_on_mod_cache_suspend = {"on_mod_cache_suspend", on_mod_cache_suspend, METH_NOARGS,
-                                        nullptr};
+PyMethodDef def_on_mod_cache_suspend = {
+  "on_mod_cache_suspend",
+  on_mod_cache_suspend,
+  METH_NOARGS,
+  nullptr
+};
 PyMethodDef def_on_mod_cache_unsuspend = {"on_mod_cache_unsuspend", on_mod_cache_unsuspend,
                                           METH_NOARGS, nullptr};
 PyMethodDef def_on_modified = {"on_modified", on_modified, METH_O, nullptr};
 PyMethodDef def_on_external_mod = {"on_external_mod", on_external_mod, METH_VARARGS, nullptr};
 PyMethodDef def_on_buffer_change = {"on_buffer_change", on_buffer_change, METH_VARARGS, nullptr};
 PyMethodDef def_on_server_changed = {"on_server_changed", on_server_changed, METH_NOARGS, nullptr};
-PyMethodDef def_on_import_resolution_changed = {
-    "on_import_resolution_changed", on_import_resolution_changed, METH_NOARGS, nullptr};
+PyMethodDef def_on_import_resolution_changed = {"on_import_resolution_changed",
+                                                on_import_resolution_changed, METH_NOARGS, nullptr};
 
 Ref handler(PyMethodDef *def, Borrowed bound_to) {
   Ref cell = py::check(PyTuple_Pack(1, bound_to.get()));
@@ -181,8 +185,8 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   // 3. the scan queue
   {
     Ref data_cache = py::getattr(f.fAnaMgr, "fLocationDataCache");
-    f._fScanQueue = py::call(Borrowed(reinterpret_cast<PyObject *>(state->ScanQueueType)),
-                             data_cache);
+    f._fScanQueue =
+        py::call(Borrowed(reinterpret_cast<PyObject *>(state->ScanQueueType)), data_cache);
     Ref cb = py::getattr(self, "_CB_QueueLocationsAdded");
     om::connect_while_alive(f._fScanQueue, host::names().locations_added, cb, self);
   }
@@ -209,15 +213,15 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   f._fPendingScanNowTriples = py::new_set();
   f.fActiveScanItem = Ref::none();
   f._fScanTripleCompletedCount = py::call(state->defaultdict, state->int_type);
-  f.fLog = py::call(py::getattr(host::modules->fastaccess, "CLogger"), py::interned("IdleAnalysis"));
+  f.fLog =
+      py::call(py::getattr(host::modules->fastaccess, "CLogger"), py::interned("IdleAnalysis"));
   f._fActiveIdleStart = -1.0;
   f._fLastLogQueue = -1.0;
   f.fWaitingForRemote = false;
   f._fIdleToWriteToDatabase = Ref::none();
   // 5. connections
   {
-    Ref mod_file_cache =
-        py::getattr(host::anamgr::AnalysisFactory(ana_mgr), "_fModFileCache");
+    Ref mod_file_cache = py::getattr(host::anamgr::AnalysisFactory(ana_mgr), "_fModFileCache");
     Ref cb = host::mainloop::NoArgCallback(handler(&def_on_mod_cache_suspend, self));
     om::connect_while_alive(mod_file_cache, py::interned("suspend"), cb, self);
     cb = host::mainloop::NoArgCallback(handler(&def_on_mod_cache_unsuspend, self));
@@ -237,8 +241,8 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   if (py::truth(py::getattr(host::modules->config, "kAvailRemoteSupport"))) {
     Ref fromlist = py::check(
         PyTuple_Pack(2, py::interned("remoteclient").get(), py::interned("containers").get()));
-    Ref pkg = py::check(
-        PyImport_ImportModuleLevel("ostrelbase", nullptr, nullptr, fromlist.get(), 0));
+    Ref pkg =
+        py::check(PyImport_ImportModuleLevel("ostrelbase", nullptr, nullptr, fromlist.get(), 0));
     Ref remoteclient = py::getattr(pkg, "remoteclient");
     Ref containers = py::getattr(pkg, "containers");
     Ref cb = host::mainloop::NoArgCallback(handler(&def_on_server_changed, self));

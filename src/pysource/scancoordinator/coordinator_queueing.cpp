@@ -54,8 +54,7 @@ void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed prior
         Ref loc = py::check(PySequence_GetItem(PyList_GET_ITEM(helper.get(), i), 0));
         py::set_add(c->f._fLocsQueuedInHelper, loc);
       }
-      host::helperprocess::AddPairsToPrimaryQueue(
-          proxy, helper, first ? first : Borrowed(Py_True));
+      host::helperprocess::AddPairsToPrimaryQueue(proxy, helper, first ? first : Borrowed(Py_True));
     }
     if (PyList_GET_SIZE(local.get()) == 0)
       return;
@@ -175,8 +174,8 @@ bool QueueBasicModules(C *c, Borrowed) {
   Ref locs = py::new_list();
   {
     Ref name = py::getattr(builtin, "fLocalName");
-    Ref found = py::call_method(factory, py::interned("GetAllLocsForName"), name,
-                                Borrowed(Py_None), Borrowed(Py_False));
+    Ref found = py::call_method(factory, py::interned("GetAllLocsForName"), name, Borrowed(Py_None),
+                                Borrowed(Py_False));
     py::for_each(found, [&](Borrowed loc) { py::list_append(locs, loc); });
   }
   Ref typing = py::call_method(factory, py::interned("GetTypingLocations"));

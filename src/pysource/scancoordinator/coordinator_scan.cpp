@@ -84,8 +84,8 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   Ref scanner = py::dict_get(active, loc);
   if (!scanner) {
     Ref incomplete = incomplete_set(c, loc);
-    scanner = new_scanner("CWholeFilePrimaryScanner", {loc.get(), scan_name.get()}, incomplete,
-                          f.fLog);
+    scanner =
+        new_scanner("CWholeFilePrimaryScanner", {loc.get(), scan_name.get()}, incomplete, f.fLog);
     py::dict_set(active, loc, scanner);
     log(c, msgs::kStartWhole, loc);
   }
@@ -150,8 +150,8 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     if (has(ana))
       py::call_method(ana, py::interned("UpdateFromCache"));
     Ref incomplete = incomplete_set(c, loc);
-    scanner = new_scanner("CSingleScopePrimaryScanner", {loc.get(), scope.get()}, incomplete,
-                          f.fLog);
+    scanner =
+        new_scanner("CSingleScopePrimaryScanner", {loc.get(), scope.get()}, incomplete, f.fLog);
     py::dict_set(active, key, scanner);
     py::call(f.fLog, py::interned(msgs::kStartScope), scope, loc);
   }
@@ -163,8 +163,7 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   if (out == Outcome::Unfinished)
     return true;
   dict_discard(active, key);
-  Ref changed =
-      py::call_method(scanner, py::interned("SaveToInfoCache"), py::Borrowed(Py_False));
+  Ref changed = py::call_method(scanner, py::interned("SaveToInfoCache"), py::Borrowed(Py_False));
   py::call(f.fLog, py::interned(msgs::kFinishScope), scope, loc, changed);
   if (!py::truth(changed)) {
     host::objectmodel::destroy(scanner);
@@ -270,21 +269,26 @@ bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double 
 namespace {
 
 // cb_state_change(scanner): bound to the cell (coordinator, scan item, [id]).
-PyObject *cb_state_change(PyObject *cell, PyObject *scanner) {
-  PY_GUARD(nullptr, {
-    C *c = reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0));
-    Borrowed item(PyTuple_GET_ITEM(cell, 1));
-    Borrowed holder(PyTuple_GET_ITEM(cell, 2));
-    sq::FinishedWaitingForData(queue(c), item);
-    call::ScheduleIdle(c);
-    Ref id = Ref::borrow(PyList_GET_ITEM(holder.get(), 0));
-    if (!id.is_none())
-      py::call_method(Borrowed(scanner), host::names().disconnect, id);
-    Py_RETURN_NONE;
-  })
-}
+PyObject *cb_state_change(PyObject *cell, PyObject *scanner){
+    PY_GUARD(nullptr,
+             {
+               C *c = reinterpret_cast<C *>(PyTuple_GET_ITEM(cell, 0));
+               Borrowed item(PyTuple_GET_ITEM(cell, 1));
+               Borrowed holder(PyTuple_GET_ITEM(cell, 2));
+               sq::FinishedWaitingForData(queue(c), item);
+               call::ScheduleIdle(c);
+               Ref id = Ref::borrow(PyList_GET_ITEM(holder.get(), 0));
+               if (!id.is_none())
+                 py::call_method(Borrowed(scanner), host::names().disconnect, id);
+               Py_RETURN_NONE;
+             })}
 
-PyMethodDef def_cb_state_change = {"cb_state_change", cb_state_change, METH_O, nullptr};
+PyMethodDef def_cb_state_change = {
+  "cb_state_change",
+  cb_state_change,
+  METH_O,
+  nullptr
+};
 
 } // namespace
 

@@ -193,8 +193,7 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
   Ref primary = host::anamgr::PrimaryScanName(f.fAnaMgr);
   Ref derived = host::anamgr::DerivedScanName(f.fAnaMgr);
   Ref names = scan_name_list.ref();
-  if (!names || names.is_none())
-  {
+  if (!names || names.is_none()) {
     names = py::new_list();
     py::list_append(names, primary);
     py::list_append(names, derived);
@@ -230,8 +229,7 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
           py::call_method(scanner, py::interned("SaveToInfoCache"));
           // An unfinished scan stays queued so the idle loop completes it.
           if (finished)
-            sq::RemoveScanTriple(queue(c), loc, scope_name, primary, Borrowed(), true,
-                                 Borrowed());
+            sq::RemoveScanTriple(queue(c), loc, scope_name, primary, Borrowed(), true, Borrowed());
         }
       }
     } catch (...) {
@@ -255,7 +253,8 @@ Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double en
   if (state->debug && !py::truth(py::call(py::getattr(si, "IsInstanceScope"), scope_name)))
     assertion_failed();
   Ref class_name = py::call(py::getattr(si, "GetClassForInstanceName"), scope_name);
-  Ref ctx = py::call_method(f._fInferenceEngine, py::interned("NewContext"), py::floating(end_time));
+  Ref ctx =
+      py::call_method(f._fInferenceEngine, py::interned("NewContext"), py::floating(end_time));
   static Ref *s_get = new Ref(py::interned("GetScopeInfo"));
   static Ref *s_out = new Ref(py::interned("OutOfTime"));
   Ref class_info = py::call_method(f._fInferenceEngine, *s_get, loc, class_name, ctx);
@@ -311,8 +310,8 @@ Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double
     Ref leaf = py::check(PySequence_GetItem(split.get(), 0));
     Ref entry = py::call_method(py::getattr(parent_info, "type_equivs"), host::names().get, leaf);
     const bool exists =
-        !entry.is_none() &&
-        py::truth(py::call(py::getattr(si, "InfoContains"), entry, py::getattr(si, "kClassPrefix")));
+        !entry.is_none() && py::truth(py::call(py::getattr(si, "InfoContains"), entry,
+                                               py::getattr(si, "kClassPrefix")));
     if (!exists) {
       Ref primary = host::anamgr::PrimaryScanName(f.fAnaMgr);
       Ref mtime = py::getattr(parent_info, "disk_mtime");

@@ -39,250 +39,153 @@ bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt
   parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
 #define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
 
-int tp_init(PyObject *self, PyObject *args, PyObject *kwds) {
-  PY_GUARD(-1, {
-    static const char *kwlist[] = {"idle_priority", "ana_mgr", nullptr};
-    PyObject *idle_priority = nullptr, *ana_mgr = nullptr;
-    if (!PyArg_ParseTupleAndKeywords(args, kwds, "OO:__init__", const_cast<char **>(kwlist),
-                                     &idle_priority, &ana_mgr))
-      return -1;
-    co::init(coord(self), arg(idle_priority), arg(ana_mgr));
-    return 0;
-  })
-}
+int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
+    PY_GUARD(-1,
+             {
+               static const char *kwlist[] = {"idle_priority", "ana_mgr", nullptr};
+               PyObject *idle_priority = nullptr, *ana_mgr = nullptr;
+               if (!PyArg_ParseTupleAndKeywords(args, kwds, "OO:__init__",
+                                                const_cast<char **>(kwlist), &idle_priority,
+                                                &ana_mgr))
+                 return -1;
+               co::init(coord(self), arg(idle_priority), arg(ana_mgr));
+               return 0;
+             })}
 
-SC_METHOD(Quitting) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("Quitting");
-    co::Quitting(coord(self));
-    return none();
-  })
-}
-SC_METHOD(_destroy_impl) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_destroy_impl");
-    co::destroy_impl(coord(self));
-    return none();
-  })
-}
-SC_METHOD(SuspendIdleScans) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("SuspendIdleScans");
-    co::SuspendIdleScans(ready(self));
-    return none();
-  })
-}
-SC_METHOD(ResumeIdleScans) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("ResumeIdleScans");
-    co::ResumeIdleScans(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_ScheduleIdle) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_ScheduleIdle");
-    co::ScheduleIdle(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_CancelIdle) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_CancelIdle");
-    co::CancelIdle(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_CB_ActiveEditLinenoChanged) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_ActiveEditLinenoChanged", 2, "ana", "new_lineno");
-    co::CB_ActiveEditLinenoChanged(ready(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_CB_NeedsScanAdded) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_NeedsScanAdded", 3, "info_cache", "needs_scan_added", "priority");
-    co::CB_NeedsScanAdded(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
-    return none();
-  })
-}
-SC_METHOD(AddNeedsScanSetToQueues) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("AddNeedsScanSetToQueues", 1, "needs_scan_set");
-    co::AddNeedsScanSetToQueues(ready(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(_QueueBasicModules) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_QueueBasicModules", 1, "end_time");
-    return boolean(co::QueueBasicModules(ready(self), arg(a[0])));
-  })
-}
-SC_METHOD(QueuesEmpty) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("QueuesEmpty", 0, "include_waiting");
-    return boolean(co::QueuesEmpty(ready(self), flag(a[0], true)));
-  })
-}
-SC_METHOD(AddParseablesToQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("AddParseablesToQueue", 1, "loc_seq", "priority");
-    py::Borrowed prio = a[1] ? arg(a[1]) : py::Borrowed(state->priorities[kBackgroundPriority]);
-    co::AddParseablesToQueue(ready(self), arg(a[0]), prio);
-    return none();
-  })
-}
-SC_METHOD(_CanSendToHelperProcess) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CanSendToHelperProcess", 2, "loc", "scope_name");
-    return boolean(co::CanSendToHelperProcess(ready(self), arg(a[0]), arg(a[1])));
-  })
-}
-SC_METHOD(AddPairsToPrimaryQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("AddPairsToPrimaryQueue", 1, "pairs", "first", "priority");
-    co::AddPairsToPrimaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
+SC_METHOD(Quitting){PY_GUARD(nullptr, {
+  SC_NOARGS("Quitting");
+  co::Quitting(coord(self));
+  return none();
+})} SC_METHOD(_destroy_impl){PY_GUARD(nullptr, {
+  SC_NOARGS("_destroy_impl");
+  co::destroy_impl(coord(self));
+  return none();
+})} SC_METHOD(SuspendIdleScans){PY_GUARD(nullptr, {
+  SC_NOARGS("SuspendIdleScans");
+  co::SuspendIdleScans(ready(self));
+  return none();
+})} SC_METHOD(ResumeIdleScans){PY_GUARD(nullptr, {
+  SC_NOARGS("ResumeIdleScans");
+  co::ResumeIdleScans(ready(self));
+  return none();
+})} SC_METHOD(_ScheduleIdle){PY_GUARD(nullptr, {
+  SC_NOARGS("_ScheduleIdle");
+  co::ScheduleIdle(ready(self));
+  return none();
+})} SC_METHOD(_CancelIdle){PY_GUARD(nullptr, {
+  SC_NOARGS("_CancelIdle");
+  co::CancelIdle(ready(self));
+  return none();
+})} SC_METHOD(_CB_ActiveEditLinenoChanged){PY_GUARD(nullptr, {
+  SC_ARGS("_CB_ActiveEditLinenoChanged", 2, "ana", "new_lineno");
+  co::CB_ActiveEditLinenoChanged(ready(self), arg(a[0]), arg(a[1]));
+  return none();
+})} SC_METHOD(_CB_NeedsScanAdded){PY_GUARD(nullptr, {
+  SC_ARGS("_CB_NeedsScanAdded", 3, "info_cache", "needs_scan_added", "priority");
+  co::CB_NeedsScanAdded(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
+  return none();
+})} SC_METHOD(AddNeedsScanSetToQueues){PY_GUARD(nullptr, {
+  SC_ARGS("AddNeedsScanSetToQueues", 1, "needs_scan_set");
+  co::AddNeedsScanSetToQueues(ready(self), arg(a[0]));
+  return none();
+})} SC_METHOD(_QueueBasicModules){PY_GUARD(nullptr, {
+  SC_ARGS("_QueueBasicModules", 1, "end_time");
+  return boolean(co::QueueBasicModules(ready(self), arg(a[0])));
+})} SC_METHOD(QueuesEmpty){PY_GUARD(nullptr, {
+  SC_ARGS("QueuesEmpty", 0, "include_waiting");
+  return boolean(co::QueuesEmpty(ready(self), flag(a[0], true)));
+})} SC_METHOD(AddParseablesToQueue){PY_GUARD(nullptr, {
+  SC_ARGS("AddParseablesToQueue", 1, "loc_seq", "priority");
+  py::Borrowed prio = a[1] ? arg(a[1]) : py::Borrowed(state->priorities[kBackgroundPriority]);
+  co::AddParseablesToQueue(ready(self), arg(a[0]), prio);
+  return none();
+})} SC_METHOD(_CanSendToHelperProcess){PY_GUARD(nullptr, {
+  SC_ARGS("_CanSendToHelperProcess", 2, "loc", "scope_name");
+  return boolean(co::CanSendToHelperProcess(ready(self), arg(a[0]), arg(a[1])));
+})} SC_METHOD(AddPairsToPrimaryQueue){PY_GUARD(nullptr, {
+  SC_ARGS("AddPairsToPrimaryQueue", 1, "pairs", "first", "priority");
+  co::AddPairsToPrimaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
+                             a[2] ? arg(a[2]) : py::Borrowed(Py_None));
+  return none();
+})} SC_METHOD(AddPairsToSecondaryQueue){PY_GUARD(nullptr, {
+  SC_ARGS("AddPairsToSecondaryQueue", 1, "pairs", "first", "priority");
+  co::AddPairsToSecondaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
                                a[2] ? arg(a[2]) : py::Borrowed(Py_None));
-    return none();
-  })
-}
-SC_METHOD(AddPairsToSecondaryQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("AddPairsToSecondaryQueue", 1, "pairs", "first", "priority");
-    co::AddPairsToSecondaryQueue(ready(self), arg(a[0]), a[1] ? arg(a[1]) : py::Borrowed(Py_True),
-                                 a[2] ? arg(a[2]) : py::Borrowed(Py_None));
-    return none();
-  })
-}
-SC_METHOD(_CB_QueueLocationsAdded) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_QueueLocationsAdded", 2, "queue", "added");
-    co::CB_QueueLocationsAdded(ready(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(LocationInPrimaryScanQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("LocationInPrimaryScanQueue", 1, "loc");
-    return boolean(co::LocationInPrimaryScanQueue(ready(self), arg(a[0])));
-  })
-}
-SC_METHOD(LocationInSecondaryScanQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("LocationInSecondaryScanQueue", 1, "loc");
-    return boolean(co::LocationInSecondaryScanQueue(ready(self), arg(a[0])));
-  })
-}
-SC_METHOD(LocationInScanQueues) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("LocationInScanQueues", 1, "loc");
-    return boolean(co::LocationInScanQueues(ready(self), arg(a[0])));
-  })
-}
-SC_METHOD(RemoveLocationsFromQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("RemoveLocationsFromQueue", 1, "to_remove");
-    co::RemoveLocationsFromQueue(ready(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(FlushQueue) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("FlushQueue");
-    co::FlushQueue(ready(self));
-    return none();
-  })
-}
-SC_METHOD(ClearLastScanInfo) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("ClearLastScanInfo", 1, "loc_iterable");
-    co::ClearLastScanInfo(ready(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(GetStatus) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("GetStatus");
-    return co::GetStatus(ready(self)).release();
-  })
-}
-SC_METHOD(__EnsureStatusTimeout) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("__EnsureStatusTimeout");
-    co::EnsureStatusTimeout(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_CB_UpdateStatus) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_CB_UpdateStatus");
-    return boolean(co::CB_UpdateStatus(ready(self)));
-  })
-}
-SC_METHOD(_ScheduleWriteToDatabaseIdle) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_ScheduleWriteToDatabaseIdle");
-    co::ScheduleWriteToDatabaseIdle(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_CB_WriteToDatabase) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_CB_WriteToDatabase");
-    co::CB_WriteToDatabase(ready(self));
-    return none();
-  })
-}
-SC_METHOD(TryToScanDictNow) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("TryToScanDictNow", 4, "for_loc", "for_scope", "needs_scan_set", "end_time");
-    double end_time = PyFloat_AsDouble(a[3]);
-    if (end_time == -1.0 && PyErr_Occurred())
-      return nullptr;
-    return boolean(co::TryToScanDictNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time));
-  })
-}
-SC_METHOD(TryToScanNow) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("TryToScanNow", 4, "loc", "scope_name", "scan_name_list", "end_time",
-            "do_secondary");
-    double end_time = PyFloat_AsDouble(a[3]);
-    if (end_time == -1.0 && PyErr_Occurred())
-      return nullptr;
-    return co::TryToScanNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time,
-                            a[4] ? arg(a[4]) : py::Borrowed(Py_True))
-        .release();
-  })
-}
-SC_METHOD(_TryToScanInstanceScopeNow) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_TryToScanInstanceScopeNow", 3, "loc", "scope_name", "end_time");
-    double end_time = PyFloat_AsDouble(a[2]);
-    if (end_time == -1.0 && PyErr_Occurred())
-      return nullptr;
-    return co::TryToScanInstanceScopeNow(ready(self), arg(a[0]), arg(a[1]), end_time).release();
-  })
-}
-SC_METHOD(BuildInstanceScopeNoScanning) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("BuildInstanceScopeNoScanning", 3, "loc", "scope_name", "end_time");
-    double end_time = PyFloat_AsDouble(a[2]);
-    if (end_time == -1.0 && PyErr_Occurred())
-      return nullptr;
-    return co::BuildInstanceScopeNoScanning(ready(self), arg(a[0]), arg(a[1]), end_time)
-        .release();
-  })
-}
-SC_METHOD(_UpdateForHelperProcess) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_UpdateForHelperProcess");
-    co::UpdateForHelperProcess(ready(self));
-    return none();
-  })
-}
-SC_METHOD(_CB_DoIdleAnalysis) {
+  return none();
+})} SC_METHOD(_CB_QueueLocationsAdded){PY_GUARD(nullptr, {
+  SC_ARGS("_CB_QueueLocationsAdded", 2, "queue", "added");
+  co::CB_QueueLocationsAdded(ready(self), arg(a[0]), arg(a[1]));
+  return none();
+})} SC_METHOD(LocationInPrimaryScanQueue){PY_GUARD(nullptr, {
+  SC_ARGS("LocationInPrimaryScanQueue", 1, "loc");
+  return boolean(co::LocationInPrimaryScanQueue(ready(self), arg(a[0])));
+})} SC_METHOD(LocationInSecondaryScanQueue){PY_GUARD(nullptr, {
+  SC_ARGS("LocationInSecondaryScanQueue", 1, "loc");
+  return boolean(co::LocationInSecondaryScanQueue(ready(self), arg(a[0])));
+})} SC_METHOD(LocationInScanQueues){PY_GUARD(nullptr, {
+  SC_ARGS("LocationInScanQueues", 1, "loc");
+  return boolean(co::LocationInScanQueues(ready(self), arg(a[0])));
+})} SC_METHOD(RemoveLocationsFromQueue){PY_GUARD(nullptr, {
+  SC_ARGS("RemoveLocationsFromQueue", 1, "to_remove");
+  co::RemoveLocationsFromQueue(ready(self), arg(a[0]));
+  return none();
+})} SC_METHOD(FlushQueue){PY_GUARD(nullptr, {
+  SC_NOARGS("FlushQueue");
+  co::FlushQueue(ready(self));
+  return none();
+})} SC_METHOD(ClearLastScanInfo){PY_GUARD(nullptr, {
+  SC_ARGS("ClearLastScanInfo", 1, "loc_iterable");
+  co::ClearLastScanInfo(ready(self), arg(a[0]));
+  return none();
+})} SC_METHOD(GetStatus){PY_GUARD(nullptr, {
+  SC_NOARGS("GetStatus");
+  return co::GetStatus(ready(self)).release();
+})} SC_METHOD(__EnsureStatusTimeout){PY_GUARD(nullptr, {
+  SC_NOARGS("__EnsureStatusTimeout");
+  co::EnsureStatusTimeout(ready(self));
+  return none();
+})} SC_METHOD(_CB_UpdateStatus){PY_GUARD(nullptr, {
+  SC_NOARGS("_CB_UpdateStatus");
+  return boolean(co::CB_UpdateStatus(ready(self)));
+})} SC_METHOD(_ScheduleWriteToDatabaseIdle){PY_GUARD(nullptr, {
+  SC_NOARGS("_ScheduleWriteToDatabaseIdle");
+  co::ScheduleWriteToDatabaseIdle(ready(self));
+  return none();
+})} SC_METHOD(_CB_WriteToDatabase){PY_GUARD(nullptr, {
+  SC_NOARGS("_CB_WriteToDatabase");
+  co::CB_WriteToDatabase(ready(self));
+  return none();
+})} SC_METHOD(TryToScanDictNow){PY_GUARD(nullptr, {
+  SC_ARGS("TryToScanDictNow", 4, "for_loc", "for_scope", "needs_scan_set", "end_time");
+  double end_time = PyFloat_AsDouble(a[3]);
+  if (end_time == -1.0 && PyErr_Occurred())
+    return nullptr;
+  return boolean(co::TryToScanDictNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time));
+})} SC_METHOD(TryToScanNow){PY_GUARD(nullptr, {
+  SC_ARGS("TryToScanNow", 4, "loc", "scope_name", "scan_name_list", "end_time", "do_secondary");
+  double end_time = PyFloat_AsDouble(a[3]);
+  if (end_time == -1.0 && PyErr_Occurred())
+    return nullptr;
+  return co::TryToScanNow(ready(self), arg(a[0]), arg(a[1]), arg(a[2]), end_time,
+                          a[4] ? arg(a[4]) : py::Borrowed(Py_True))
+      .release();
+})} SC_METHOD(_TryToScanInstanceScopeNow){PY_GUARD(nullptr, {
+  SC_ARGS("_TryToScanInstanceScopeNow", 3, "loc", "scope_name", "end_time");
+  double end_time = PyFloat_AsDouble(a[2]);
+  if (end_time == -1.0 && PyErr_Occurred())
+    return nullptr;
+  return co::TryToScanInstanceScopeNow(ready(self), arg(a[0]), arg(a[1]), end_time).release();
+})} SC_METHOD(BuildInstanceScopeNoScanning){PY_GUARD(nullptr, {
+  SC_ARGS("BuildInstanceScopeNoScanning", 3, "loc", "scope_name", "end_time");
+  double end_time = PyFloat_AsDouble(a[2]);
+  if (end_time == -1.0 && PyErr_Occurred())
+    return nullptr;
+  return co::BuildInstanceScopeNoScanning(ready(self), arg(a[0]), arg(a[1]), end_time).release();
+})} SC_METHOD(_UpdateForHelperProcess){PY_GUARD(nullptr, {
+  SC_NOARGS("_UpdateForHelperProcess");
+  co::UpdateForHelperProcess(ready(self));
+  return none();
+})} SC_METHOD(_CB_DoIdleAnalysis) {
   PY_GUARD(nullptr, {
     SC_NOARGS("_CB_DoIdleAnalysis");
     return co::CB_DoIdleAnalysis(ready(self));
@@ -294,83 +197,72 @@ double as_time(PyObject *o) {
     py::throw_error();
   return v;
 }
-SC_METHOD(__DoScans) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__DoScans", 1, "end_time");
-    co::DoScans(ready(self), as_time(a[0]));
-    return none();
-  })
-}
-SC_METHOD(__CheckWholeFiles) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__CheckWholeFiles", 1, "end_time");
-    return boolean(co::CheckWholeFiles(ready(self), as_time(a[0])));
-  })
-}
-SC_METHOD(_DoSingleScan) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_DoSingleScan", 2, "scan_item", "end_time");
-    return boolean(co::DoSingleScan(ready(self), arg(a[0]), as_time(a[1])));
-  })
-}
-SC_METHOD(__GetAnalysis) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__GetAnalysis", 2, "loc", "create");
-    return co::GetAnalysis(ready(self), arg(a[0]), flag(a[1], false)).release();
-  })
-}
-SC_METHOD(__DoPrimaryWholeFileScan) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__DoPrimaryWholeFileScan", 2, "scan_item", "end_time");
-    return boolean(co::DoPrimaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
-  })
-}
-SC_METHOD(__DoPrimarySingleScopeScan) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__DoPrimarySingleScopeScan", 2, "scan_item", "end_time");
-    return boolean(co::DoPrimarySingleScopeScan(ready(self), arg(a[0]), as_time(a[1])));
-  })
-}
-SC_METHOD(__DoSecondaryWholeFileScan) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__DoSecondaryWholeFileScan", 2, "scan_item", "end_time");
-    return boolean(co::DoSecondaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
-  })
-}
-SC_METHOD(__DoSecondarySingleScopeScan) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__DoSecondarySingleScopeScan", 3, "loc", "scope_name", "end_time");
-    return boolean(
-        co::DoSecondarySingleScopeScan(ready(self), arg(a[0]), arg(a[1]), as_time(a[2])));
-  })
-}
-SC_METHOD(_WaitForScannerToBeReady) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_WaitForScannerToBeReady", 2, "scanner", "scan_item");
-    co::WaitForScannerToBeReady(ready(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(__AddImportEquivsToQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__AddImportEquivsToQueue", 3, "imported_equivs", "dirloc", "priority");
-    co::AddImportEquivsToQueue(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
-    return none();
-  })
-}
-SC_METHOD(__GetModtimeDict) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__GetModtimeDict", 1, "loc_seq");
-    return co::GetModtimeDict(ready(self), arg(a[0])).release();
-  })
-}
-SC_METHOD(__GetModtimes) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("__GetModtimes", 2, "loc_seq", "completion_cb", "force");
-    co::GetModtimes(ready(self), arg(a[0]), arg(a[1]), a[2] ? arg(a[2]) : py::Borrowed(Py_False));
-    return none();
-  })
-}
+SC_METHOD(__DoScans){PY_GUARD(nullptr,
+                              {
+                                SC_ARGS("__DoScans", 1, "end_time");
+                                co::DoScans(ready(self), as_time(a[0]));
+                                return none();
+                              })} SC_METHOD(__CheckWholeFiles){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__CheckWholeFiles", 1, "end_time");
+               return boolean(co::CheckWholeFiles(ready(self), as_time(a[0])));
+             })} SC_METHOD(_DoSingleScan){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_DoSingleScan", 2, "scan_item", "end_time");
+               return boolean(co::DoSingleScan(ready(self), arg(a[0]), as_time(a[1])));
+             })} SC_METHOD(__GetAnalysis){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__GetAnalysis", 2, "loc", "create");
+               return co::GetAnalysis(ready(self), arg(a[0]), flag(a[1], false)).release();
+             })} SC_METHOD(__DoPrimaryWholeFileScan){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__DoPrimaryWholeFileScan", 2, "scan_item", "end_time");
+               return boolean(co::DoPrimaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
+             })} SC_METHOD(__DoPrimarySingleScopeScan){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__DoPrimarySingleScopeScan", 2, "scan_item", "end_time");
+               return boolean(co::DoPrimarySingleScopeScan(ready(self), arg(a[0]), as_time(a[1])));
+             })} SC_METHOD(__DoSecondaryWholeFileScan){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__DoSecondaryWholeFileScan", 2, "scan_item", "end_time");
+               return boolean(co::DoSecondaryWholeFileScan(ready(self), arg(a[0]), as_time(a[1])));
+             })} SC_METHOD(__DoSecondarySingleScopeScan){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__DoSecondarySingleScopeScan", 3, "loc", "scope_name", "end_time");
+               return boolean(co::DoSecondarySingleScopeScan(ready(self), arg(a[0]), arg(a[1]),
+                                                             as_time(a[2])));
+             })} SC_METHOD(_WaitForScannerToBeReady){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_WaitForScannerToBeReady", 2, "scanner", "scan_item");
+               co::WaitForScannerToBeReady(ready(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(__AddImportEquivsToQueue){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__AddImportEquivsToQueue", 3, "imported_equivs", "dirloc", "priority");
+               co::AddImportEquivsToQueue(ready(self), arg(a[0]), arg(a[1]), arg(a[2]));
+               return none();
+             })} SC_METHOD(__GetModtimeDict){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__GetModtimeDict", 1, "loc_seq");
+               return co::GetModtimeDict(ready(self), arg(a[0])).release();
+             })} SC_METHOD(__GetModtimes){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("__GetModtimes", 2, "loc_seq", "completion_cb", "force");
+               co::GetModtimes(ready(self), arg(a[0]), arg(a[1]),
+                               a[2] ? arg(a[2]) : py::Borrowed(Py_False));
+               return none();
+             })}
 
 #define SC_DEF(name, doc)                                                                          \
   {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
@@ -427,9 +319,10 @@ PyMethodDef methods[] = {
     SC_PRIVATE(__GetModtimeDict, nullptr),
     SC_PRIVATE(__GetModtimes, nullptr),
     SC_DEF(GetStatus, nullptr),
-    SC_PRIVATE(__EnsureStatusTimeout,
-     "Make sure that the status timeout is installed or removed according to whether work is\n"
-     "being done; removal is done by the callback itself"),
+    SC_PRIVATE(
+        __EnsureStatusTimeout,
+        "Make sure that the status timeout is installed or removed according to whether work is\n"
+        "being done; removal is done by the callback itself"),
     SC_DEF(_CB_UpdateStatus, "Called periodically to update status"),
     SC_DEF(_ScheduleWriteToDatabaseIdle, "Schedule an idle that will call WriteToDatabase()"),
     SC_DEF(_CB_WriteToDatabase, nullptr),
@@ -501,8 +394,8 @@ PyGetSetDef getset[] = {
     {"_fPendingScanNowTriples", SC_REF_GETTER(Obj, _fPendingScanNowTriples), nullptr, nullptr,
      nullptr},
     {"fActiveScanItem", SC_REF_GETTER(Obj, fActiveScanItem), nullptr, nullptr, nullptr},
-    {"_fScanTripleCompletedCount", SC_REF_GETTER(Obj, _fScanTripleCompletedCount), nullptr,
-     nullptr, nullptr},
+    {"_fScanTripleCompletedCount", SC_REF_GETTER(Obj, _fScanTripleCompletedCount), nullptr, nullptr,
+     nullptr},
     {"fLog", SC_REF_GETTER(Obj, fLog), nullptr, nullptr, nullptr},
     {"_fActiveIdleStart", SC_FLOAT_GETTER(_fActiveIdleStart), nullptr, nullptr, nullptr},
     {"_fLastLogQueue", SC_FLOAT_GETTER(_fLastLogQueue), nullptr, nullptr, nullptr},
@@ -674,8 +567,7 @@ bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
 }
 bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoSecondarySingleScopeScan", m___DoSecondarySingleScopeScan,
-          ov))
+  if (own(c, "_CScanCoordinator__DoSecondarySingleScopeScan", m___DoSecondarySingleScopeScan, ov))
     return co::DoSecondarySingleScopeScan(c, loc, scope_name, end_time);
   return py::truth(py::call(ov, loc, scope_name, py::floating(end_time)));
 }

@@ -163,7 +163,8 @@ void exec_body(py::Borrowed module) {
 
   // 4. CScanItem
   {
-    py::Ref fields = py::check(Py_BuildValue("[ssss]", "loc", "scope_name", "scan_name", "priority"));
+    py::Ref fields =
+        py::check(Py_BuildValue("[ssss]", "loc", "scope_name", "scan_name", "priority"));
     st->CScanItem = namedtuple(fields, "CScanItem", mod_name);
     bind(dict, "CScanItem", st->CScanItem);
     st->empty_item = make_scan_item(py::Borrowed(Py_None), py::Borrowed(Py_None),
@@ -172,10 +173,8 @@ void exec_body(py::Borrowed module) {
   // 5. the priorities, published in one update of the globals
   {
     py::Ref update = py::new_dict();
-    const char *pnames[] = {"kTypingModulePriority", "kInteractivePriority",
-                            "kBackgroundPriority"};
-    const long long pvalues[] = {kTypingModulePriority, kInteractivePriority,
-                                 kBackgroundPriority};
+    const char *pnames[] = {"kTypingModulePriority", "kInteractivePriority", "kBackgroundPriority"};
+    const long long pvalues[] = {kTypingModulePriority, kInteractivePriority, kBackgroundPriority};
     for (int i = 0; i < 3; ++i) {
       st->priorities[i] = py::integer(pvalues[i]);
       py::check_int(PyDict_SetItemString(update.get(), pnames[i], st->priorities[i].get()));
@@ -193,7 +192,8 @@ void exec_body(py::Borrowed module) {
         namedtuple(py::str("scan_name priority file_count"), "CSingleQueueStatus", mod_name);
     bind(dict, "CSingleQueueStatus", st->CSingleQueueStatus);
     py::setattr(st->CSingleQueueStatus, py::interned("__module__"), mod_name);
-    st->CScanStatus = namedtuple(py::str("queue_status_list waiting_count"), "CScanStatus", mod_name);
+    st->CScanStatus =
+        namedtuple(py::str("queue_status_list waiting_count"), "CScanStatus", mod_name);
     bind(dict, "CScanStatus", st->CScanStatus);
     py::setattr(st->CScanStatus, py::interned("__module__"), mod_name);
   }
@@ -444,6 +444,4 @@ long long as_int64(py::Borrowed o) {
 
 } // namespace scancoord
 
-PyMODINIT_FUNC PyInit_scancoordinator(void) {
-  return PyModuleDef_Init(&scancoord::module_def);
-}
+PyMODINIT_FUNC PyInit_scancoordinator(void) { return PyModuleDef_Init(&scancoord::module_def); }

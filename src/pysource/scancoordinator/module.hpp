@@ -18,17 +18,17 @@ constexpr long long kMaxWholeFilesPerCheck = 25;
 constexpr double kMinRescanInterval = 5.0;
 
 struct State {
-  py::Ref module;                  // the one module object of this process
-  py::Ref CScanItem;               // collections.namedtuple record types
+  py::Ref module;    // the one module object of this process
+  py::Ref CScanItem; // collections.namedtuple record types
   py::Ref CSingleQueueStatus;
   py::Ref CScanStatus;
-  py::Ref defaultdict;             // collections.defaultdict
-  py::Ref int_type;                // int, the defaultdict factory
-  py::Ref kWildcardScope;          // symbolinfo.kWildcardScope ('*')
-  py::Ref empty_item;              // CScanItem(None, None, None, None)
-  py::Ref priorities[3];           // the three published priority ints
-  py::Ref not_found_result;        // (False, None, None), shared
-  py::Ref waiting_result;          // (True, None, None), shared
+  py::Ref defaultdict;      // collections.defaultdict
+  py::Ref int_type;         // int, the defaultdict factory
+  py::Ref kWildcardScope;   // symbolinfo.kWildcardScope ('*')
+  py::Ref empty_item;       // CScanItem(None, None, None, None)
+  py::Ref priorities[3];    // the three published priority ints
+  py::Ref not_found_result; // (False, None, None), shared
+  py::Ref waiting_result;   // (True, None, None), shared
   PyTypeObject *SingleQueueType = nullptr;
   PyTypeObject *ScanQueueType = nullptr;
   PyTypeObject *CoordinatorType = nullptr;

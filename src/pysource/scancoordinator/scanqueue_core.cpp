@@ -270,8 +270,8 @@ Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bor
 // ---- adding --------------------------------------------------------------
 
 namespace {
-void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
-                             Borrowed k, LocInfo &info);
+void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority, Borrowed k,
+                             LocInfo &info);
 } // namespace
 
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
@@ -351,8 +351,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     if (!scope_is_wild) {
       if (!wild_key)
         wild_key = make_key(wildcard, scan_name);
-      Ref whole =
-          info ? py::dict_get(info.pending, wild_key) : find_waiting_priority(q, loc);
+      Ref whole = info ? py::dict_get(info.pending, wild_key) : find_waiting_priority(q, loc);
       if (whole && as_int64(whole) <= p)
         continue;
     }
@@ -401,8 +400,8 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
 namespace {
 // _AddScanToPerLocationMap with the location's entry already looked up
 // (empty when it has none).
-void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
-                             Borrowed k, LocInfo &info) {
+void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority, Borrowed k,
+                             LocInfo &info) {
   if (!info) {
     info.counts = new_counts_dict();
     info.pending = py::new_dict();

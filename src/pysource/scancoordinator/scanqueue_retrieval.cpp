@@ -261,8 +261,8 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
     if (py::eq(Borrowed(PyList_GET_ITEM(names.get(), 0)), wildcard)) {
       Ref snapshot = py::check(PyList_GetSlice(target.get(), 0, PyList_GET_SIZE(t)));
       for (Py_ssize_t i = 0; i < PyList_GET_SIZE(snapshot.get()); ++i)
-        RemoveScanFromPerLocationMap(q, loc, Borrowed(PyList_GET_ITEM(snapshot.get(), i)),
-                                     to_name, to_prio, Borrowed());
+        RemoveScanFromPerLocationMap(q, loc, Borrowed(PyList_GET_ITEM(snapshot.get(), i)), to_name,
+                                     to_prio, Borrowed());
       py::check_int(PyList_SetSlice(target.get(), 0, PyList_GET_SIZE(t), nullptr));
       py::list_append(target, wildcard);
     } else {
@@ -350,9 +350,9 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     SingleQueueObject *sq = as_single_queue(PyList_GET_ITEM(queues.get(), i));
     Ref uod = sq->f.fOrderedDict;
     Ref scan_name = sq->f.fScanName ? sq->f.fScanName : Ref::none();
-    Ref line = py::check(PyUnicode_FromFormat(" Scan queue for %U; priority=%lld count=%zd\n",
-                                              fmt(scan_name).get(), sq->f.fPriority,
-                                              om::size(uod)));
+    Ref line =
+        py::check(PyUnicode_FromFormat(" Scan queue for %U; priority=%lld count=%zd\n",
+                                       fmt(scan_name).get(), sq->f.fPriority, om::size(uod)));
     write_text(write, line);
     if (count < limit) {
       Ref it = py::check(PyObject_GetIter(om::items(uod).get()));
@@ -378,12 +378,12 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
   Ref waiting = q->f._fWaitingForInspectByLoc;
   Py_ssize_t nwait = PyDict_GET_SIZE(waiting.get());
   if (nwait != 0) {
-    Ref line = py::check(PyUnicode_FromFormat("Waiting for %zd remote files to be inspected", nwait));
+    Ref line =
+        py::check(PyUnicode_FromFormat("Waiting for %zd remote files to be inspected", nwait));
     write_text(write, line);
     Ref keys = py::check(PyDict_Keys(waiting.get()));
     for (Py_ssize_t i = 0; i < PyList_GET_SIZE(keys.get()) && i < limit; ++i)
-      write_fmt(write, "  File: %U\n",
-                py::check(PyObject_Repr(PyList_GET_ITEM(keys.get(), i))));
+      write_fmt(write, "  File: %U\n", py::check(PyObject_Repr(PyList_GET_ITEM(keys.get(), i))));
     if (nwait >= limit)
       write_text(write, py::interned("  ...\n"));
   }
@@ -394,8 +394,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     write_text(write, line);
     Ref items = py::check(PySequence_List(data.get()));
     for (Py_ssize_t i = 0; i < PyList_GET_SIZE(items.get()) && i < limit; ++i)
-      write_fmt(write, "  Scan: %U\n",
-                py::check(PyObject_Repr(PyList_GET_ITEM(items.get(), i))));
+      write_fmt(write, "  Scan: %U\n", py::check(PyObject_Repr(PyList_GET_ITEM(items.get(), i))));
     if (ndata >= limit)
       write_text(write, py::interned("  ...\n"));
   }

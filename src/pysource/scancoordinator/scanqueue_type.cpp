@@ -83,332 +83,294 @@ bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt
   parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
 #define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
 
-int tp_init(PyObject *self, PyObject *args, PyObject *kwds) {
-  PY_GUARD(-1, {
-    static const char *kwlist[] = {"location_data_cache", nullptr};
-    PyObject *cache = nullptr;
-    if (!PyArg_ParseTupleAndKeywords(args, kwds, "O:__init__", const_cast<char **>(kwlist),
-                                     &cache))
-      return -1;
-    sq::init(reinterpret_cast<Q *>(self), arg(cache));
-    return 0;
-  })
-}
+int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
+    PY_GUARD(-1,
+             {
+               static const char *kwlist[] = {"location_data_cache", nullptr};
+               PyObject *cache = nullptr;
+               if (!PyArg_ParseTupleAndKeywords(args, kwds, "O:__init__",
+                                                const_cast<char **>(kwlist), &cache))
+                 return -1;
+               sq::init(reinterpret_cast<Q *>(self), arg(cache));
+               return 0;
+             })}
 
-SC_METHOD(SetScansToOrder) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("SetScansToOrder", 1, "scans_to_order");
-    sq::SetScansToOrder(queue(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(_GetSingleQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_GetSingleQueue", 2, "scan_name", "priority");
-    return sq::GetSingleQueue(queue(self), arg(a[0]), as_int64(arg(a[1]))).release();
-  })
-}
-SC_METHOD(_FindScanPriority) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_FindScanPriority", 3, "loc", "scope_name", "scan_name");
-    return or_none(
-        sq::FindScanPriority(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), py::Borrowed()));
-  })
-}
-SC_METHOD(AddScanPairs) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("AddScanPairs", 2, "pair_seq", "scan_name", "priority", "add_to_check");
-    sq::AddScanPairs(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), flag(a[3], false));
-    return none();
-  })
-}
-SC_METHOD(_AddReadyScanPairs) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_AddReadyScanPairs", 4, "ready_pair_list", "scan_name", "priority", "add_to_check");
-    Q *q = queue(self);
-    sq::PairList pairs;
-    py::for_each(arg(a[0]), [&](py::Borrowed pair) {
-      py::Ref parts[2];
-      unpack(pair, 2, parts);
-      pairs.emplace_back(std::move(parts[0]), std::move(parts[1]));
-    });
-    sq::AddReadyScanPairs(q, pairs, arg(a[1]), arg(a[2]), flag(a[3], false));
-    return none();
-  })
-}
-SC_METHOD(_AddScanToPerLocationMap) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_AddScanToPerLocationMap", 4, "loc", "scope_name", "scan_name", "priority");
-    sq::AddScanToPerLocationMap(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), arg(a[3]),
-                                py::Borrowed());
-    return none();
-  })
-}
-SC_METHOD(_RemoveScanFromPerLocationMap) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_RemoveScanFromPerLocationMap", 4, "loc", "scope_name", "scan_name", "priority");
-    return boolean(sq::RemoveScanFromPerLocationMap(queue(self), arg(a[0]), arg(a[1]), arg(a[2]),
-                                                    arg(a[3]), py::Borrowed()));
-  })
-}
-SC_METHOD(RemoveScanTriple) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("RemoveScanTriple", 1, "scan_triple", "priority", "remove_waiting");
-    Q *q = queue(self);
-    py::Ref t[3];
-    unpack(arg(a[0]), 3, t);
-    return boolean(
-        sq::RemoveScanTriple(q, t[0], t[1], t[2], arg(a[1]), flag(a[2], true), py::Borrowed()));
-  })
-}
-SC_METHOD(RemoveAllForLocations) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("RemoveAllForLocations", 1, "loc_seq", "scan_name_set", "remove_waiting");
-    sq::RemoveAllForLocations(queue(self), arg(a[0]), arg(a[1]), flag(a[2], true));
-    return none();
-  })
-}
-SC_METHOD(Clear) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("Clear");
-    sq::Clear(queue(self));
-    return none();
-  })
-}
-SC_METHOD(ScanCompleted) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("ScanCompleted", 1, "scan_item");
-    sq::ScanCompleted(queue(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(_destroy_impl) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_destroy_impl");
-    sq::destroy_impl(reinterpret_cast<Q *>(self));
-    return none();
-  })
-}
-SC_METHOD(First) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("First");
-    return sq::First(queue(self)).release();
-  })
-}
-SC_METHOD(_FirstOrNone) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_FirstOrNone");
-    return or_none(sq::FirstOrNone(queue(self)));
-  })
-}
-SC_METHOD(PopWholeFilesToCheck) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("PopWholeFilesToCheck", 0, "max_files");
-    Py_ssize_t max_files = a[0] ? static_cast<Py_ssize_t>(as_int64(arg(a[0])))
-                                : static_cast<Py_ssize_t>(kMaxWholeFilesPerCheck);
-    return sq::PopWholeFilesToCheck(queue(self), max_files).release();
-  })
-}
-SC_METHOD(GetPendingDictForLoc) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("GetPendingDictForLoc", 1, "loc");
-    return or_none(sq::GetPendingDictForLoc(queue(self), arg(a[0])));
-  })
-}
-SC_METHOD(LocationInQueue) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("LocationInQueue", 1, "loc", "scan_name");
-    return boolean(sq::LocationInQueue(queue(self), arg(a[0]), arg(a[1])));
-  })
-}
-SC_METHOD(Empty) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("Empty", 0, "include_waiting");
-    return boolean(sq::Empty(queue(self), flag(a[0], true)));
-  })
-}
-SC_METHOD(GetFileCount) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("GetFileCount", 2, "scan_name", "priority");
-    return PyLong_FromSsize_t(sq::GetFileCount(queue(self), arg(a[0]), arg(a[1])));
-  })
-}
-SC_METHOD(GetScanCount) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("GetScanCount", 1, "scan_item");
-    return sq::GetScanCount(queue(self), arg(a[0])).release();
-  })
-}
-SC_METHOD(GetWaitingCount) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("GetWaitingCount");
-    return PyLong_FromSsize_t(sq::GetWaitingCount(queue(self)));
-  })
-}
-SC_METHOD(UpdateForVisibleDocuments) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("UpdateForVisibleDocuments", 2, "active_loc", "visible_locs");
-    sq::UpdateForVisibleDocuments(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_MoveScansBetweenQueues) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_MoveScansBetweenQueues", 4, "loc", "names_to_move", "from_queue", "to_queue");
-    sq::MoveScansBetweenQueues(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), arg(a[3]));
-    return none();
-  })
-}
-SC_METHOD(_CB_SingletonChanged) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_CB_SingletonChanged");
-    sq::CB_SingletonChanged(queue(self));
-    return none();
-  })
-}
-SC_METHOD(_CB_ActiveDocChanged) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_CB_ActiveDocChanged");
-    sq::CB_ActiveDocChanged(queue(self));
-    return none();
-  })
-}
-SC_METHOD(PrintScanQueues) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("PrintScanQueues", 0, "write", "limit");
-    Py_ssize_t limit = a[1] ? static_cast<Py_ssize_t>(as_int64(arg(a[1]))) : 100;
-    sq::PrintScanQueues(queue(self), arg(a[0]), limit);
-    return none();
-  })
-}
-SC_METHOD(IsTreeBranchReady) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("IsTreeBranchReady", 1, "leaf_loc");
-    return boolean(sq::IsTreeBranchReady(queue(self), arg(a[0])));
-  })
-}
-SC_METHOD(_MoveScansForLocToWaitingForInspect) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_MoveScansForLocToWaitingForInspect", 1, "loc", "check_whole_file_priority");
-    sq::MoveScansForLocToWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_AddItemsWaitingForInspect) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_AddItemsWaitingForInspect", 2, "loc", "item_seq");
-    sq::AddItemsWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_SetWholeFileCheckWaitingForInspect) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_SetWholeFileCheckWaitingForInspect", 2, "loc", "check_whole_file_priority");
-    sq::SetWholeFileCheckWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_CB_TreeBranchesNowReady) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_TreeBranchesNowReady", 2, "data", "ready_set");
-    sq::CB_TreeBranchesNowReady(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_CB_InspectFailed) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_InspectFailed", 2, "loc_data_cache", "loc_set");
-    (void)a;
-    (void)self;
-    return none();
-  })
-}
-SC_METHOD(_CB_LocReadyCleared) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_CB_LocReadyCleared", 1, "loc_data_cache");
-    (void)a;
-    (void)self;
-    return none();
-  })
-}
-SC_METHOD(StartWaitingForData) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("StartWaitingForData", 1, "scan_item");
-    sq::StartWaitingForData(queue(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(FinishedWaitingForData) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("FinishedWaitingForData", 1, "scan_item");
-    sq::FinishedWaitingForData(queue(self), arg(a[0]));
-    return none();
-  })
-}
-SC_METHOD(_UpdatePendingSets) {
-  PY_GUARD(nullptr, {
-    SC_ARGS("_UpdatePendingSets", 2, "added_set", "removed_set");
-    sq::UpdatePendingSets(queue(self), arg(a[0]), arg(a[1]));
-    return none();
-  })
-}
-SC_METHOD(_SignalEmitIdle) {
-  PY_GUARD(nullptr, {
-    SC_NOARGS("_SignalEmitIdle");
-    sq::SignalEmitIdle(queue(self));
-    return none();
-  })
-}
+SC_METHOD(SetScansToOrder){PY_GUARD(nullptr,
+                                    {
+                                      SC_ARGS("SetScansToOrder", 1, "scans_to_order");
+                                      sq::SetScansToOrder(queue(self), arg(a[0]));
+                                      return none();
+                                    })} SC_METHOD(_GetSingleQueue){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_GetSingleQueue", 2, "scan_name", "priority");
+               return sq::GetSingleQueue(queue(self), arg(a[0]), as_int64(arg(a[1]))).release();
+             })} SC_METHOD(_FindScanPriority){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_FindScanPriority", 3, "loc", "scope_name", "scan_name");
+               return or_none(sq::FindScanPriority(queue(self), arg(a[0]), arg(a[1]), arg(a[2]),
+                                                   py::Borrowed()));
+             })} SC_METHOD(AddScanPairs){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("AddScanPairs", 2, "pair_seq", "scan_name", "priority", "add_to_check");
+               sq::AddScanPairs(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), flag(a[3], false));
+               return none();
+             })} SC_METHOD(_AddReadyScanPairs){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_AddReadyScanPairs", 4, "ready_pair_list", "scan_name", "priority",
+                       "add_to_check");
+               Q *q = queue(self);
+               sq::PairList pairs;
+               py::for_each(arg(a[0]), [&](py::Borrowed pair) {
+                 py::Ref parts[2];
+                 unpack(pair, 2, parts);
+                 pairs.emplace_back(std::move(parts[0]), std::move(parts[1]));
+               });
+               sq::AddReadyScanPairs(q, pairs, arg(a[1]), arg(a[2]), flag(a[3], false));
+               return none();
+             })} SC_METHOD(_AddScanToPerLocationMap){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_AddScanToPerLocationMap", 4, "loc", "scope_name", "scan_name", "priority");
+               sq::AddScanToPerLocationMap(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), arg(a[3]),
+                                           py::Borrowed());
+               return none();
+             })} SC_METHOD(_RemoveScanFromPerLocationMap){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_RemoveScanFromPerLocationMap", 4, "loc", "scope_name", "scan_name",
+                       "priority");
+               return boolean(sq::RemoveScanFromPerLocationMap(
+                   queue(self), arg(a[0]), arg(a[1]), arg(a[2]), arg(a[3]), py::Borrowed()));
+             })} SC_METHOD(RemoveScanTriple){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("RemoveScanTriple", 1, "scan_triple", "priority", "remove_waiting");
+               Q *q = queue(self);
+               py::Ref t[3];
+               unpack(arg(a[0]), 3, t);
+               return boolean(sq::RemoveScanTriple(q, t[0], t[1], t[2], arg(a[1]), flag(a[2], true),
+                                                   py::Borrowed()));
+             })} SC_METHOD(RemoveAllForLocations){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("RemoveAllForLocations", 1, "loc_seq", "scan_name_set", "remove_waiting");
+               sq::RemoveAllForLocations(queue(self), arg(a[0]), arg(a[1]), flag(a[2], true));
+               return none();
+             })} SC_METHOD(Clear){PY_GUARD(nullptr,
+                                           {
+                                             SC_NOARGS("Clear");
+                                             sq::Clear(queue(self));
+                                             return none();
+                                           })} SC_METHOD(ScanCompleted){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("ScanCompleted", 1, "scan_item");
+               sq::ScanCompleted(queue(self), arg(a[0]));
+               return none();
+             })} SC_METHOD(_destroy_impl){PY_GUARD(nullptr,
+                                                   {
+                                                     SC_NOARGS("_destroy_impl");
+                                                     sq::destroy_impl(reinterpret_cast<Q *>(self));
+                                                     return none();
+                                                   })} SC_METHOD(First){
+    PY_GUARD(nullptr,
+             {
+               SC_NOARGS("First");
+               return sq::First(queue(self)).release();
+             })} SC_METHOD(_FirstOrNone){PY_GUARD(nullptr,
+                                                  {
+                                                    SC_NOARGS("_FirstOrNone");
+                                                    return or_none(sq::FirstOrNone(queue(self)));
+                                                  })} SC_METHOD(PopWholeFilesToCheck){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("PopWholeFilesToCheck", 0, "max_files");
+               Py_ssize_t max_files = a[0] ? static_cast<Py_ssize_t>(as_int64(arg(a[0])))
+                                           : static_cast<Py_ssize_t>(kMaxWholeFilesPerCheck);
+               return sq::PopWholeFilesToCheck(queue(self), max_files).release();
+             })} SC_METHOD(GetPendingDictForLoc){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("GetPendingDictForLoc", 1, "loc");
+               return or_none(sq::GetPendingDictForLoc(queue(self), arg(a[0])));
+             })} SC_METHOD(LocationInQueue){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("LocationInQueue", 1, "loc", "scan_name");
+               return boolean(sq::LocationInQueue(queue(self), arg(a[0]), arg(a[1])));
+             })} SC_METHOD(Empty){PY_GUARD(nullptr,
+                                           {
+                                             SC_ARGS("Empty", 0, "include_waiting");
+                                             return boolean(
+                                                 sq::Empty(queue(self), flag(a[0], true)));
+                                           })} SC_METHOD(GetFileCount){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("GetFileCount", 2, "scan_name", "priority");
+               return PyLong_FromSsize_t(sq::GetFileCount(queue(self), arg(a[0]), arg(a[1])));
+             })} SC_METHOD(GetScanCount){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("GetScanCount", 1, "scan_item");
+               return sq::GetScanCount(queue(self), arg(a[0])).release();
+             })} SC_METHOD(GetWaitingCount){PY_GUARD(nullptr,
+                                                     {
+                                                       SC_NOARGS("GetWaitingCount");
+                                                       return PyLong_FromSsize_t(
+                                                           sq::GetWaitingCount(queue(self)));
+                                                     })} SC_METHOD(UpdateForVisibleDocuments){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("UpdateForVisibleDocuments", 2, "active_loc", "visible_locs");
+               sq::UpdateForVisibleDocuments(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_MoveScansBetweenQueues){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_MoveScansBetweenQueues", 4, "loc", "names_to_move", "from_queue",
+                       "to_queue");
+               sq::MoveScansBetweenQueues(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), arg(a[3]));
+               return none();
+             })} SC_METHOD(_CB_SingletonChanged){PY_GUARD(nullptr,
+                                                          {
+                                                            SC_NOARGS("_CB_SingletonChanged");
+                                                            sq::CB_SingletonChanged(queue(self));
+                                                            return none();
+                                                          })} SC_METHOD(_CB_ActiveDocChanged){
+    PY_GUARD(nullptr,
+             {
+               SC_NOARGS("_CB_ActiveDocChanged");
+               sq::CB_ActiveDocChanged(queue(self));
+               return none();
+             })} SC_METHOD(PrintScanQueues){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("PrintScanQueues", 0, "write", "limit");
+               Py_ssize_t limit = a[1] ? static_cast<Py_ssize_t>(as_int64(arg(a[1]))) : 100;
+               sq::PrintScanQueues(queue(self), arg(a[0]), limit);
+               return none();
+             })} SC_METHOD(IsTreeBranchReady){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("IsTreeBranchReady", 1, "leaf_loc");
+               return boolean(sq::IsTreeBranchReady(queue(self), arg(a[0])));
+             })} SC_METHOD(_MoveScansForLocToWaitingForInspect){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_MoveScansForLocToWaitingForInspect", 1, "loc",
+                       "check_whole_file_priority");
+               sq::MoveScansForLocToWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_AddItemsWaitingForInspect){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_AddItemsWaitingForInspect", 2, "loc", "item_seq");
+               sq::AddItemsWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_SetWholeFileCheckWaitingForInspect){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_SetWholeFileCheckWaitingForInspect", 2, "loc",
+                       "check_whole_file_priority");
+               sq::SetWholeFileCheckWaitingForInspect(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_CB_TreeBranchesNowReady){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_CB_TreeBranchesNowReady", 2, "data", "ready_set");
+               sq::CB_TreeBranchesNowReady(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_CB_InspectFailed){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_CB_InspectFailed", 2, "loc_data_cache", "loc_set");
+               (void)a;
+               (void)self;
+               return none();
+             })} SC_METHOD(_CB_LocReadyCleared){PY_GUARD(nullptr,
+                                                         {
+                                                           SC_ARGS("_CB_LocReadyCleared", 1,
+                                                                   "loc_data_cache");
+                                                           (void)a;
+                                                           (void)self;
+                                                           return none();
+                                                         })} SC_METHOD(StartWaitingForData){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("StartWaitingForData", 1, "scan_item");
+               sq::StartWaitingForData(queue(self), arg(a[0]));
+               return none();
+             })} SC_METHOD(FinishedWaitingForData){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("FinishedWaitingForData", 1, "scan_item");
+               sq::FinishedWaitingForData(queue(self), arg(a[0]));
+               return none();
+             })} SC_METHOD(_UpdatePendingSets){
+    PY_GUARD(nullptr,
+             {
+               SC_ARGS("_UpdatePendingSets", 2, "added_set", "removed_set");
+               sq::UpdatePendingSets(queue(self), arg(a[0]), arg(a[1]));
+               return none();
+             })} SC_METHOD(_SignalEmitIdle){PY_GUARD(nullptr,
+                                                     {
+                                                       SC_NOARGS("_SignalEmitIdle");
+                                                       sq::SignalEmitIdle(queue(self));
+                                                       return none();
+                                                     })}
 
 #define SC_DEF(name, doc)                                                                          \
   {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
    METH_FASTCALL | METH_KEYWORDS, doc}
 
 PyMethodDef methods[] = {
-    SC_DEF(SetScansToOrder, "Sets the dict mapping scan names to the order to do them in"),
-    SC_DEF(_GetSingleQueue, nullptr),
-    SC_DEF(_FindScanPriority, "Returns the priority for scan in queue or None if not in queue"),
-    SC_DEF(AddScanPairs, "Add seq of (loc, scope-name) pairs for given scan name and priority"),
-    SC_DEF(_AddReadyScanPairs,
-           "Add pairs implementation that assumes all locations given are ready"),
-    SC_DEF(_AddScanToPerLocationMap, nullptr),
-    SC_DEF(_RemoveScanFromPerLocationMap, nullptr),
-    SC_DEF(RemoveScanTriple, "Remove Scan"),
-    SC_DEF(RemoveAllForLocations, "Remove all scans for all locations in given sequence"),
-    SC_DEF(Clear, nullptr),
-    SC_DEF(ScanCompleted, nullptr),
-    SC_DEF(_destroy_impl, nullptr),
-    SC_DEF(First,
-           "Returns first scan in any queue as a CScanItem; CScanItem(None, None, None, None) "
-           "if empty"),
-    SC_DEF(_FirstOrNone, nullptr),
-    SC_DEF(PopWholeFilesToCheck, nullptr),
-    SC_DEF(GetPendingDictForLoc, nullptr),
-    SC_DEF(LocationInQueue, nullptr),
-    SC_DEF(Empty, nullptr),
-    SC_DEF(GetFileCount, nullptr),
-    SC_DEF(GetScanCount, "Return number of times scan has been completed"),
-    SC_DEF(GetWaitingCount, "Return number of files waiting for inspection or for data"),
-    SC_DEF(UpdateForVisibleDocuments, "Update priorities for active & visible locations"),
-    SC_DEF(_MoveScansBetweenQueues, nullptr),
-    SC_DEF(_CB_SingletonChanged, nullptr),
-    SC_DEF(_CB_ActiveDocChanged, nullptr),
-    SC_DEF(PrintScanQueues, nullptr),
-    SC_DEF(IsTreeBranchReady, nullptr),
-    SC_DEF(_MoveScansForLocToWaitingForInspect, nullptr),
-    SC_DEF(_AddItemsWaitingForInspect, nullptr),
-    SC_DEF(_SetWholeFileCheckWaitingForInspect, nullptr),
-    SC_DEF(_CB_TreeBranchesNowReady, "Called when locations become ready"),
-    SC_DEF(_CB_InspectFailed, nullptr),
-    SC_DEF(_CB_LocReadyCleared, nullptr),
-    SC_DEF(StartWaitingForData, nullptr),
-    SC_DEF(FinishedWaitingForData, nullptr),
-    SC_DEF(_UpdatePendingSets,
-           "If a location is added and then removed it ends up in both sets, but if it is "
-           "removed and then added it ends up in neither; None may be passed for no adds or "
-           "no removals"),
-    SC_DEF(_SignalEmitIdle, "Emits signals; to be used as an idle proc"),
-    {nullptr, nullptr, 0, nullptr}};
+  SC_DEF(SetScansToOrder, "Sets the dict mapping scan names to the order to do them in"),
+  SC_DEF(_GetSingleQueue, nullptr),
+  SC_DEF(_FindScanPriority, "Returns the priority for scan in queue or None if not in queue"),
+  SC_DEF(AddScanPairs, "Add seq of (loc, scope-name) pairs for given scan name and priority"),
+  SC_DEF(_AddReadyScanPairs, "Add pairs implementation that assumes all locations given are ready"),
+  SC_DEF(_AddScanToPerLocationMap, nullptr),
+  SC_DEF(_RemoveScanFromPerLocationMap, nullptr),
+  SC_DEF(RemoveScanTriple, "Remove Scan"),
+  SC_DEF(RemoveAllForLocations, "Remove all scans for all locations in given sequence"),
+  SC_DEF(Clear, nullptr),
+  SC_DEF(ScanCompleted, nullptr),
+  SC_DEF(_destroy_impl, nullptr),
+  SC_DEF(First, "Returns first scan in any queue as a CScanItem; CScanItem(None, None, None, None) "
+                "if empty"),
+  SC_DEF(_FirstOrNone, nullptr),
+  SC_DEF(PopWholeFilesToCheck, nullptr),
+  SC_DEF(GetPendingDictForLoc, nullptr),
+  SC_DEF(LocationInQueue, nullptr),
+  SC_DEF(Empty, nullptr),
+  SC_DEF(GetFileCount, nullptr),
+  SC_DEF(GetScanCount, "Return number of times scan has been completed"),
+  SC_DEF(GetWaitingCount, "Return number of files waiting for inspection or for data"),
+  SC_DEF(UpdateForVisibleDocuments, "Update priorities for active & visible locations"),
+  SC_DEF(_MoveScansBetweenQueues, nullptr),
+  SC_DEF(_CB_SingletonChanged, nullptr),
+  SC_DEF(_CB_ActiveDocChanged, nullptr),
+  SC_DEF(PrintScanQueues, nullptr),
+  SC_DEF(IsTreeBranchReady, nullptr),
+  SC_DEF(_MoveScansForLocToWaitingForInspect, nullptr),
+  SC_DEF(_AddItemsWaitingForInspect, nullptr),
+  SC_DEF(_SetWholeFileCheckWaitingForInspect, nullptr),
+  SC_DEF(_CB_TreeBranchesNowReady, "Called when locations become ready"),
+  SC_DEF(_CB_InspectFailed, nullptr),
+  SC_DEF(_CB_LocReadyCleared, nullptr),
+  SC_DEF(StartWaitingForData, nullptr),
+  SC_DEF(FinishedWaitingForData, nullptr),
+  SC_DEF(_UpdatePendingSets,
+         "If a location is added and then removed it ends up in both sets, but if it is "
+         "removed and then added it ends up in neither; None may be passed for no adds or "
+         "no removals"),
+  SC_DEF(_SignalEmitIdle, "Emits signals; to be used as an idle proc"),
+  {nullptr, nullptr, 0, nullptr}
+};
 
 PyObject *get_any_async(PyObject *self, void *) {
   return boolean(reinterpret_cast<Obj *>(self)->f.fAnyAsyncInspectLocation);
@@ -471,9 +433,9 @@ bool own(Q *q, const char *name, Fast fn, py::Ref &override_out) {
 py::Ref pair_list(const sq::PairList &pairs) {
   py::Ref list = py::check(PyList_New(static_cast<Py_ssize_t>(pairs.size())));
   for (size_t i = 0; i < pairs.size(); ++i)
-    PyList_SET_ITEM(list.get(), static_cast<Py_ssize_t>(i),
-                    py::check(PyTuple_Pack(2, pairs[i].first.get(), pairs[i].second.get()))
-                        .release());
+    PyList_SET_ITEM(
+        list.get(), static_cast<Py_ssize_t>(i),
+        py::check(PyTuple_Pack(2, pairs[i].first.get(), pairs[i].second.get())).release());
   return list;
 }
 

@@ -128,7 +128,7 @@ void StartWaitingForData(Q *q, Borrowed scan_item) {
   if (py::set_contains(waiting, scan_item))
     return;
   call::RemoveScanTriple(q, item_field(scan_item, 0), item_field(scan_item, 1),
-                   item_field(scan_item, 2), item_field(scan_item, 3), true, Borrowed());
+                         item_field(scan_item, 2), item_field(scan_item, 3), true, Borrowed());
   py::set_add(waiting, scan_item);
 }
 
@@ -137,8 +137,8 @@ void FinishedWaitingForData(Q *q, Borrowed scan_item) {
   if (!py::set_contains(waiting, scan_item))
     return;
   py::set_discard(waiting, scan_item);
-  Ref pair = py::check(
-      PyTuple_Pack(2, item_field(scan_item, 0).get(), item_field(scan_item, 1).get()));
+  Ref pair =
+      py::check(PyTuple_Pack(2, item_field(scan_item, 0).get(), item_field(scan_item, 1).get()));
   Ref seq = py::check(PyTuple_Pack(1, pair.get()));
   call::AddScanPairs(q, seq, item_field(scan_item, 2), item_field(scan_item, 3), false);
 }

@@ -54,35 +54,35 @@ void init_fields(Obj *self, py::Borrowed scan_name, long long priority, long lon
   self->f.fOrderedDict = host::orderedmap::create();
 }
 
-int tp_init(PyObject *self, PyObject *args, PyObject *kwds) {
-  PY_GUARD(-1, {
-    static const char *const names[] = {"scan_name", "priority", "order"};
-    // Route through the vectorcall-style parser for identical messages.
-    Py_ssize_t nargs = PyTuple_GET_SIZE(args);
-    py::Ref kwnames;
-    PyObject **items = PySequence_Fast_ITEMS(args);
-    std::vector<PyObject *> argv(items, items + nargs);
-    if (kwds && PyDict_GET_SIZE(kwds)) {
-      kwnames = py::check(PyTuple_New(PyDict_GET_SIZE(kwds)));
-      Py_ssize_t pos = 0, i = 0;
-      PyObject *k, *v;
-      while (PyDict_Next(kwds, &pos, &k, &v)) {
-        PyTuple_SET_ITEM(kwnames.get(), i++, py::Ref::borrow(k).release());
-        argv.push_back(v);
-      }
-    }
-    PyObject *out[3];
-    parse_args("__init__", argv.data(), nargs, kwnames.get(), names, 3, 3, out);
-    // The base class first, with no signals: a single queue emits nothing.
-    host::objectmodel::base_init(py::Borrowed(self), py::Borrowed());
-    auto *obj = reinterpret_cast<Obj *>(self);
-    obj->f.fScanName = py::Ref::borrow(out[0]);
-    obj->f.fPriority = as_int64(py::Borrowed(out[1]));
-    obj->f.fOrder = as_int64(py::Borrowed(out[2]));
-    obj->f.fOrderedDict = host::orderedmap::create();
-    return 0;
-  })
-}
+int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
+    PY_GUARD(-1,
+             {
+               static const char *const names[] = {"scan_name", "priority", "order"};
+               // Route through the vectorcall-style parser for identical messages.
+               Py_ssize_t nargs = PyTuple_GET_SIZE(args);
+               py::Ref kwnames;
+               PyObject **items = PySequence_Fast_ITEMS(args);
+               std::vector<PyObject *> argv(items, items + nargs);
+               if (kwds && PyDict_GET_SIZE(kwds)) {
+                 kwnames = py::check(PyTuple_New(PyDict_GET_SIZE(kwds)));
+                 Py_ssize_t pos = 0, i = 0;
+                 PyObject *k, *v;
+                 while (PyDict_Next(kwds, &pos, &k, &v)) {
+                   PyTuple_SET_ITEM(kwnames.get(), i++, py::Ref::borrow(k).release());
+                   argv.push_back(v);
+                 }
+               }
+               PyObject *out[3];
+               parse_args("__init__", argv.data(), nargs, kwnames.get(), names, 3, 3, out);
+               // The base class first, with no signals: a single queue emits nothing.
+               host::objectmodel::base_init(py::Borrowed(self), py::Borrowed());
+               auto *obj = reinterpret_cast<Obj *>(self);
+               obj->f.fScanName = py::Ref::borrow(out[0]);
+               obj->f.fPriority = as_int64(py::Borrowed(out[1]));
+               obj->f.fOrder = as_int64(py::Borrowed(out[2]));
+               obj->f.fOrderedDict = host::orderedmap::create();
+               return 0;
+             })}
 
 PyObject *get_priority(PyObject *self, void *) {
   return PyLong_FromLongLong(reinterpret_cast<Obj *>(self)->f.fPriority);

@@ -53,9 +53,9 @@ template <typename Obj> void typed_dealloc(PyObject *self) {
 
 // Getter of a py::Ref field; an unset field reads as None.
 #define SC_REF_GETTER(Obj, field)                                                                  \
-  [](PyObject *self, void *) -> PyObject * {                                                      \
-    PyObject *v = reinterpret_cast<Obj *>(self)->f.field.get();                                   \
-    return ::py::Ref::borrow(v ? v : Py_None).release();                                          \
+  [](PyObject *self, void *) -> PyObject * {                                                       \
+    PyObject *v = reinterpret_cast<Obj *>(self)->f.field.get();                                    \
+    return ::py::Ref::borrow(v ? v : Py_None).release();                                           \
   }
 
 } // namespace scancoord

@@ -13,7 +13,7 @@ for p in (str(ROOT / "standin"), _ext, str(ROOT / "tests")):
     if p not in sys.path:
         sys.path.insert(0 if p.endswith("standin") else len(sys.path), p)
 
-import pytest  # noqa: E402
+import pytest
 
 # Shared fixture and double modules get pytest's assertion rewriting too.
 pytest.register_assert_rewrite("scanqueue_fixtures", "coord_doubles", "scan_doubles")

@@ -17,9 +17,10 @@ import gc
 import sys
 import weakref
 
-import pysource.scancoordinator as sc
 from guiutils import ostrelgtk
 from ostrelbase import destroyable
+
+import pysource.scancoordinator as sc
 
 
 class DataCache(destroyable.CDestroyable):
@@ -42,7 +43,7 @@ def cycle_check():
     cache.queue = queue  # the cache refers back to the queue
     queue.SetScansToOrder({"p": 0})
     queue.AddScanPairs([(f"loc{i}", "*") for i in range(100)], "p", 2, True)
-    queue.connect("locations-added", lambda *args: queue.Empty())  # handler -> queue
+    queue.connect("locations-added", lambda *args, q=queue: q.Empty())  # handler -> queue
     ref_q, ref_c = weakref.ref(queue), weakref.ref(cache)
     queue.destroy()
     del queue, cache

@@ -21,8 +21,9 @@ import time
 from pathlib import Path
 
 import hostapp
-import pysource.scancoordinator as sc
 from guiutils import ostrelgtk
+
+import pysource.scancoordinator as sc
 
 
 def main(argv):

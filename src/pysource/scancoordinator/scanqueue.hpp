@@ -22,6 +22,7 @@
 #include "pysource/scancoordinator/module.hpp"
 #include "pysource/scancoordinator/types.hpp"
 
+#include <new>
 #include <utility>
 #include <vector>
 
@@ -40,7 +41,97 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority);
 Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed key);
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check);
-using PairList = std::vector<std::pair<Ref, Ref>>;
+// An append-only list of (location, scope name) pairs, in order, for one
+// call.  It may hold every pair of a large batch, so it avoids one large
+// transient buffer that the C allocator would keep resident afterwards:
+//  - as a view, it refers to the caller's tuple of pairs and records which of
+//    them are taken as runs of indices (usually a single run);
+//  - otherwise it owns the pairs, in small blocks from Python's allocator.
+struct PairRef {
+  Borrowed first, second;
+};
+
+class PairList {
+  static constexpr size_t kPerBlock = 15; // a block stays within 256 bytes
+  struct Block {
+    Block *next;
+    size_t used;
+    std::pair<Ref, Ref> items[kPerBlock];
+  };
+  struct Run {
+    Py_ssize_t begin, end;
+  };
+
+public:
+  PairList() = default;
+  // A view over `pairs`, a tuple whose items are 2-tuples.
+  explicit PairList(Ref pairs) : view_(std::move(pairs)) {}
+  PairList(const PairList &) = delete;
+  PairList &operator=(const PairList &) = delete;
+  PairList(PairList &&o) noexcept
+      : view_(std::move(o.view_)), runs_(std::move(o.runs_)), head_(o.head_), tail_(o.tail_),
+        size_(o.size_) {
+    o.head_ = o.tail_ = nullptr;
+    o.size_ = 0;
+  }
+  ~PairList() {
+    Block *b = head_;
+    while (b) {
+      Block *next = b->next;
+      for (size_t i = 0; i < b->used; ++i)
+        b->items[i].~pair();
+      PyMem_Free(b);
+      b = next;
+    }
+  }
+  // Owned mode: append a pair.
+  void emplace_back(Ref a, Ref b) {
+    if (!tail_ || tail_->used == kPerBlock) {
+      auto *blk = static_cast<Block *>(PyMem_Malloc(sizeof(Block)));
+      if (!blk)
+        throw std::bad_alloc();
+      blk->next = nullptr;
+      blk->used = 0;
+      (tail_ ? tail_->next : head_) = blk;
+      tail_ = blk;
+    }
+    new (&tail_->items[tail_->used]) std::pair<Ref, Ref>(std::move(a), std::move(b));
+    ++tail_->used;
+    ++size_;
+  }
+  // View mode: take the pair at index i (indices ascending).
+  void take(Py_ssize_t i) {
+    if (!runs_.empty() && runs_.back().end == i)
+      ++runs_.back().end;
+    else
+      runs_.push_back(Run{i, i + 1});
+    ++size_;
+  }
+  size_t size() const { return size_; }
+  bool empty() const { return size_ == 0; }
+
+  // Calls f(PairRef) for every pair, in order.
+  template <typename F> void for_each(F &&f) const {
+    if (view_) {
+      for (const Run &r : runs_)
+        for (Py_ssize_t i = r.begin; i < r.end; ++i) {
+          PyObject *pair = PyTuple_GET_ITEM(view_.get(), i);
+          f(PairRef{Borrowed(PyTuple_GET_ITEM(pair, 0)), Borrowed(PyTuple_GET_ITEM(pair, 1))});
+        }
+      return;
+    }
+    for (const Block *b = head_; b; b = b->next)
+      for (size_t i = 0; i < b->used; ++i)
+        f(PairRef{Borrowed(b->items[i].first), Borrowed(b->items[i].second)});
+  }
+
+private:
+  Ref view_;
+  std::vector<Run> runs_;
+  Block *head_ = nullptr;
+  Block *tail_ = nullptr;
+  size_t size_ = 0;
+};
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,

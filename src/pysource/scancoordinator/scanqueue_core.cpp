@@ -274,31 +274,56 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
                              LocInfo &info);
 } // namespace
 
+namespace {
+// One pair of AddScanPairs: ready pairs are taken, the others parked.
+// Returns whether the pair's location is ready.
+bool sort_pair(Q *q, Borrowed pair, Borrowed scan_name, Borrowed prio, bool add_to_check, Ref *lp) {
+  unpack_tuple(pair, 2, lp);
+  if (!q->f.fAnyAsyncInspectLocation && host::locations::IsAsyncInspectLocation(lp[0]))
+    q->f.fAnyAsyncInspectLocation = true;
+  if (call::IsTreeBranchReady(q, lp[0]))
+    return true;
+  Ref item = make_scan_item(lp[0], lp[1], scan_name, prio);
+  Ref items = py::check(PyTuple_Pack(1, item.get()));
+  AddItemsWaitingForInspect(q, lp[0], items);
+  if (add_to_check)
+    SetWholeFileCheckWaitingForInspect(q, lp[0], prio);
+  return false;
+}
+} // namespace
+
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check) {
   Ref prio = priority && !priority.is_none() ? priority.ref() : state->priorities[2];
-  PairList ready;
+  // A list or tuple of pairs is read through a tuple (the list copied first,
+  // so that host code run meanwhile cannot change what is being walked) and
+  // the ready pairs are recorded as index runs; any other iterable is walked
+  // once and its ready pairs kept.
+  Ref snapshot;
+  if (PyTuple_CheckExact(pair_seq.get()))
+    snapshot = pair_seq.ref();
+  else if (PyList_CheckExact(pair_seq.get()))
+    snapshot = py::check(PyList_AsTuple(pair_seq.get()));
+  PairList ready = snapshot ? PairList(snapshot) : PairList();
   try {
-    Ref it = py::check(PyObject_GetIter(pair_seq.get()));
-    for (;;) {
-      Ref pair = Ref::steal(PyIter_Next(it.get()));
-      if (!pair) {
-        if (PyErr_Occurred())
-          py::throw_error();
-        break;
-      }
-      Ref lp[2];
-      unpack_tuple(pair, 2, lp);
-      if (!q->f.fAnyAsyncInspectLocation && host::locations::IsAsyncInspectLocation(lp[0]))
-        q->f.fAnyAsyncInspectLocation = true;
-      if (call::IsTreeBranchReady(q, lp[0])) {
-        ready.emplace_back(std::move(lp[0]), std::move(lp[1]));
-      } else {
-        Ref item = make_scan_item(lp[0], lp[1], scan_name, prio);
-        Ref items = py::check(PyTuple_Pack(1, item.get()));
-        AddItemsWaitingForInspect(q, lp[0], items);
-        if (add_to_check)
-          SetWholeFileCheckWaitingForInspect(q, lp[0], prio);
+    Ref lp[2];
+    if (snapshot) {
+      const Py_ssize_t n = PyTuple_GET_SIZE(snapshot.get());
+      for (Py_ssize_t i = 0; i < n; ++i)
+        if (sort_pair(q, Borrowed(PyTuple_GET_ITEM(snapshot.get(), i)), scan_name, prio,
+                      add_to_check, lp))
+          ready.take(i);
+    } else {
+      Ref it = py::check(PyObject_GetIter(pair_seq.get()));
+      for (;;) {
+        Ref pair = Ref::steal(PyIter_Next(it.get()));
+        if (!pair) {
+          if (PyErr_Occurred())
+            py::throw_error();
+          break;
+        }
+        if (sort_pair(q, pair, scan_name, prio, add_to_check, lp))
+          ready.emplace_back(std::move(lp[0]), std::move(lp[1]));
       }
     }
   } catch (const py::PyError &) {
@@ -332,7 +357,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
   Ref whole_files = q->f._fWholeFilesToCheck;
   const Borrowed wildcard = state->kWildcardScope;
 
-  for (const auto &lp : pairs) {
+  pairs.for_each([&](PairRef lp) {
     Borrowed loc = lp.first, scope = lp.second;
     Ref key = make_key(scope, scan_name);
     LocInfo info = loc_info(q, loc);
@@ -343,7 +368,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
         call::RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
         info = loc_info(q, loc); // the removal may have dropped the entry
       } else {
-        continue;
+        return;
       }
     }
     // 2. the whole file already queued at the same or a better priority?
@@ -353,7 +378,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
         wild_key = make_key(wildcard, scan_name);
       Ref whole = info ? py::dict_get(info.pending, wild_key) : find_waiting_priority(q, loc);
       if (whole && as_int64(whole) <= p)
-        continue;
+        return;
     }
     // 3.-7. the single queue's name list
     const bool first = PySet_GET_SIZE(visible.get()) != 0 && py::set_contains(visible, loc);
@@ -369,7 +394,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
         py::throw_error();
       }
       if (py::eq(Borrowed(PyList_GET_ITEM(l, 0)), wildcard))
-        continue;
+        return;
       if (scope_is_wild) {
         for (Py_ssize_t i = 0; i < PyList_GET_SIZE(l); ++i) {
           Ref name = Ref::borrow(PyList_GET_ITEM(l, i));
@@ -387,14 +412,14 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
         else if (i == n)
           py::list_append(name_list, scope);
         else
-          continue;
+          return;
       }
     }
     // 8. bookkeeping; 9. the whole-file check
     add_to_per_location_map(q, loc, scan_name, prio, key, info);
     if (add_to_check)
       py::dict_set(whole_files, loc, prio);
-  }
+  });
 }
 
 namespace {

@@ -432,10 +432,11 @@ bool own(Q *q, const char *name, Fast fn, py::Ref &override_out) {
 
 py::Ref pair_list(const sq::PairList &pairs) {
   py::Ref list = py::check(PyList_New(static_cast<Py_ssize_t>(pairs.size())));
-  for (size_t i = 0; i < pairs.size(); ++i)
-    PyList_SET_ITEM(
-        list.get(), static_cast<Py_ssize_t>(i),
-        py::check(PyTuple_Pack(2, pairs[i].first.get(), pairs[i].second.get())).release());
+  Py_ssize_t i = 0;
+  pairs.for_each([&](sq::PairRef p) {
+    PyList_SET_ITEM(list.get(), i++,
+                    py::check(PyTuple_Pack(2, p.first.get(), p.second.get())).release());
+  });
   return list;
 }
 

@@ -25,19 +25,6 @@ C *ready(PyObject *self) {
   }
   return c;
 }
-PyObject *none() { return py::Ref::none().release(); }
-PyObject *boolean(bool b) { return py::Ref::of_bool(b).release(); }
-py::Borrowed arg(PyObject *o) { return py::Borrowed(o); }
-bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt; }
-
-#define SC_METHOD(name)                                                                            \
-  PyObject *m_##name(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames)
-#define SC_ARGS(fname, required, ...)                                                              \
-  static const char *const names_[] = {__VA_ARGS__};                                               \
-  constexpr int total_ = sizeof(names_) / sizeof(names_[0]);                                       \
-  PyObject *a[total_];                                                                             \
-  parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
-#define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
 
 int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
     PY_GUARD(-1,
@@ -264,9 +251,6 @@ SC_METHOD(__DoScans){PY_GUARD(nullptr,
                return none();
              })}
 
-#define SC_DEF(name, doc)                                                                          \
-  {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
-   METH_FASTCALL | METH_KEYWORDS, doc}
 // A class-private method, published under its mangled name.
 #define SC_PRIVATE(name, doc)                                                                      \
   {"_CScanCoordinator" #name,                                                                      \
@@ -423,22 +407,9 @@ PyType_Spec spec = {"pysource.scancoordinator.CScanCoordinator", sizeof(Obj), 0,
 
 // ---- dispatch ------------------------------------------------------------
 
-using Fast = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyObject *);
-
-// Whether `name` on this object is our own implementation; otherwise
-// `override_out` receives the attribute to call.
-bool own(C *c, const char *name, Fast fn, py::Ref &override_out) {
-  PyObject *self = reinterpret_cast<PyObject *>(c);
-  if (Py_TYPE(self) == state->CoordinatorType)
-    return true;
-  py::Ref meth = py::getattr(py::Borrowed(self), name);
-  if (PyCFunction_Check(meth.get()) &&
-      reinterpret_cast<void (*)()>(PyCFunction_GET_FUNCTION(meth.get())) ==
-          reinterpret_cast<void (*)()>(fn) &&
-      PyCFunction_GET_SELF(meth.get()) == self)
-    return true;
-  override_out = std::move(meth);
-  return false;
+bool own(C *c, const char *name, FastMethod fn, py::Ref &override_out) {
+  return own_method(reinterpret_cast<PyObject *>(c), state->CoordinatorType, name, fn,
+                    override_out);
 }
 
 } // namespace
@@ -612,9 +583,7 @@ void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
 } // namespace co::call
 
 PyTypeObject *create_coordinator_type(py::Borrowed module) {
-  py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));
-  py::Ref type = py::check(PyType_FromModuleAndSpec(module.get(), &spec, base.get()));
-  return reinterpret_cast<PyTypeObject *>(type.release());
+  return create_derived_type(module, &spec);
 }
 
 } // namespace scancoord

@@ -68,20 +68,7 @@ Q *queue(PyObject *self) {
   return q;
 }
 
-PyObject *none() { return py::Ref::none().release(); }
-PyObject *boolean(bool b) { return py::Ref::of_bool(b).release(); }
 PyObject *or_none(py::Ref r) { return r ? r.release() : none(); }
-py::Borrowed arg(PyObject *o) { return py::Borrowed(o); }
-bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt; }
-
-#define SC_METHOD(name)                                                                            \
-  PyObject *m_##name(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames)
-#define SC_ARGS(fname, required, ...)                                                              \
-  static const char *const names_[] = {__VA_ARGS__};                                               \
-  constexpr int total_ = sizeof(names_) / sizeof(names_[0]);                                       \
-  PyObject *a[total_];                                                                             \
-  parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
-#define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
 
 int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
     PY_GUARD(-1,
@@ -323,10 +310,6 @@ SC_METHOD(SetScansToOrder){PY_GUARD(nullptr,
                                                        return none();
                                                      })}
 
-#define SC_DEF(name, doc)                                                                          \
-  {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
-   METH_FASTCALL | METH_KEYWORDS, doc}
-
 PyMethodDef methods[] = {
   SC_DEF(SetScansToOrder, "Sets the dict mapping scan names to the order to do them in"),
   SC_DEF(_GetSingleQueue, nullptr),
@@ -414,20 +397,8 @@ PyType_Spec spec = {"pysource.scancoordinator._CScanQueue", sizeof(Obj), 0,
 
 // ---- dispatch ------------------------------------------------------------
 
-using Fast = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyObject *);
-
-bool own(Q *q, const char *name, Fast fn, py::Ref &override_out) {
-  PyObject *self = reinterpret_cast<PyObject *>(q);
-  if (Py_TYPE(self) == state->ScanQueueType)
-    return true;
-  py::Ref meth = py::getattr(py::Borrowed(self), name);
-  if (PyCFunction_Check(meth.get()) &&
-      reinterpret_cast<void (*)()>(PyCFunction_GET_FUNCTION(meth.get())) ==
-          reinterpret_cast<void (*)()>(fn) &&
-      PyCFunction_GET_SELF(meth.get()) == self)
-    return true;
-  override_out = std::move(meth);
-  return false;
+bool own(Q *q, const char *name, FastMethod fn, py::Ref &override_out) {
+  return own_method(reinterpret_cast<PyObject *>(q), state->ScanQueueType, name, fn, override_out);
 }
 
 py::Ref pair_list(const sq::PairList &pairs) {
@@ -530,9 +501,7 @@ void Clear(Q *q) {
 } // namespace sq::call
 
 PyTypeObject *create_scan_queue_type(py::Borrowed module) {
-  py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));
-  py::Ref type = py::check(PyType_FromModuleAndSpec(module.get(), &spec, base.get()));
-  return reinterpret_cast<PyTypeObject *>(type.release());
+  return create_derived_type(module, &spec);
 }
 
 ScanQueueObject *as_scan_queue(PyObject *o) {

@@ -113,9 +113,7 @@ PyType_Spec spec = {"pysource.scancoordinator._CSingleScanQueue", sizeof(Obj), 0
 } // namespace
 
 PyTypeObject *create_single_queue_type(py::Borrowed module) {
-  py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));
-  py::Ref type = py::check(PyType_FromModuleAndSpec(module.get(), &spec, base.get()));
-  return reinterpret_cast<PyTypeObject *>(type.release()); // kept by the module state
+  return create_derived_type(module, &spec);
 }
 
 py::Ref new_single_queue(py::Borrowed scan_name, long long priority, long long order) {

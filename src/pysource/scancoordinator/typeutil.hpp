@@ -51,6 +51,56 @@ template <typename Obj> void typed_dealloc(PyObject *self) {
   Py_DECREF(type);
 }
 
+// ---- method tables ---------------------------------------------------------
+
+inline PyObject *none() { return py::Ref::none().release(); }
+inline PyObject *boolean(bool b) { return py::Ref::of_bool(b).release(); }
+inline py::Borrowed arg(PyObject *o) { return py::Borrowed(o); }
+inline bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o)) : dflt; }
+
+// A METH_FASTCALL | METH_KEYWORDS method named m_<name>, its argument parsing,
+// and its method-table entry.
+#define SC_METHOD(name)                                                                            \
+  PyObject *m_##name(PyObject *self, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames)
+#define SC_ARGS(fname, required, ...)                                                              \
+  static const char *const names_[] = {__VA_ARGS__};                                               \
+  constexpr int total_ = sizeof(names_) / sizeof(names_[0]);                                       \
+  PyObject *a[total_];                                                                             \
+  parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
+#define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
+#define SC_DEF(name, doc)                                                                          \
+  {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
+   METH_FASTCALL | METH_KEYWORDS, doc}
+
+// ---- overridable dispatch --------------------------------------------------
+
+using FastMethod = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyObject *);
+
+// Whether the module's own implementation of `name` applies to `self`: always
+// for an instance of `exact` itself (no attribute lookup); for a subclass
+// instance when the attribute is still our built-in method bound to it.
+// Otherwise `override_out` receives the attribute to call.
+inline bool own_method(PyObject *self, PyTypeObject *exact, const char *name, FastMethod fn,
+                       py::Ref &override_out) {
+  if (Py_TYPE(self) == exact)
+    return true;
+  py::Ref meth = py::getattr(py::Borrowed(self), name);
+  if (PyCFunction_Check(meth.get()) &&
+      reinterpret_cast<void (*)()>(PyCFunction_GET_FUNCTION(meth.get())) ==
+          reinterpret_cast<void (*)()>(fn) &&
+      PyCFunction_GET_SELF(meth.get()) == self)
+    return true;
+  override_out = std::move(meth);
+  return false;
+}
+
+// A heap type of this module derived from the host's destroyable base.
+inline PyTypeObject *create_derived_type(py::Borrowed module, PyType_Spec *spec) {
+  py::Ref base = py::Ref::borrow(reinterpret_cast<PyObject *>(host::objectmodel::base_type()));
+  py::Ref type = py::check(PyType_FromModuleAndSpec(module.get(), spec, base.get()));
+  return reinterpret_cast<PyTypeObject *>(type.release()); // kept by the module state
+}
+
 // Getter of a py::Ref field; an unset field reads as None.
 #define SC_REF_GETTER(Obj, field)                                                                  \
   [](PyObject *self, void *) -> PyObject * {                                                       \

@@ -651,8 +651,10 @@ void destroy_impl(Q *q) {
     return;
   call::Clear(q);
   Ref idle = q->f._fSignalEmitIdle;
-  if (idle && !idle.is_none())
+  if (idle && !idle.is_none()) {
     host::mainloop::idle_remove(idle);
+    q->f._fSignalEmitIdle = Ref::none(); // a cancelled callback's id is not kept
+  }
 }
 
 } // namespace scancoord::sq

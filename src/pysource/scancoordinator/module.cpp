@@ -405,6 +405,20 @@ void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
     out[i] = py::Ref::borrow(PyTuple_GET_ITEM(o, i));
 }
 
+namespace {
+// getattr(o, name, None) without raising: 1 found, 0 absent, -1 error.
+int optional_attr(PyObject *o, const char *name, PyObject **out) {
+  *out = PyObject_GetAttrString(o, name);
+  if (*out)
+    return 1;
+  if (PyErr_ExceptionMatches(PyExc_AttributeError)) {
+    PyErr_Clear();
+    return 0;
+  }
+  return -1;
+}
+} // namespace
+
 bool starts_with(py::Borrowed s, py::Borrowed prefix) {
   py::Ref p = prefix.ref();
   if (PyBytes_Check(s.get())) {
@@ -426,7 +440,16 @@ bool starts_with(py::Borrowed s, py::Borrowed prefix) {
       py::throw_error();
     return r != 0;
   }
-  return false;
+  // Any other object (a bytearray, a str subclass's own method...) answers
+  // through its own startswith, as Python code would.
+  PyObject *attr = nullptr;
+  const int found = optional_attr(s.get(), "startswith", &attr);
+  if (found < 0)
+    py::throw_error();
+  if (found == 0)
+    return false;
+  py::Ref meth = py::Ref::steal(attr);
+  return py::truth(py::call(meth, p));
 }
 
 py::Ref like(py::Borrowed s, const char *ascii) {

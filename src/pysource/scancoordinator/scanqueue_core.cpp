@@ -77,12 +77,22 @@ Ref new_counts_dict() {
 void store_count_pair(Q *q, Borrowed scan_name, Ref &pair, long long scans, long long locs) {
   if (pair && PyTuple_CheckExact(pair.get()) && PyTuple_GET_SIZE(pair.get()) == 2 &&
       Py_REFCNT(pair.get()) == 2) {
-    Ref a = py::integer(scans), b = py::integer(locs);
     PyObject *t = pair.get();
-    // The tuple's old items are adopted and released once it is consistent.
-    Ref old0 = Ref::steal(PyTuple_GET_ITEM(t, 0)), old1 = Ref::steal(PyTuple_GET_ITEM(t, 1));
-    PyTuple_SET_ITEM(t, 0, a.release());
-    PyTuple_SET_ITEM(t, 1, b.release());
+    // Each item is replaced only when its value changed (the location count
+    // rarely does); a replaced item is released once the tuple is consistent.
+    const long long values[2] = {scans, locs};
+    for (Py_ssize_t i = 0; i < 2; ++i) {
+      PyObject *item = PyTuple_GET_ITEM(t, i);
+      if (PyLong_CheckExact(item)) {
+        const long long v = PyLong_AsLongLong(item);
+        if (v == values[i])
+          continue;
+        PyErr_Clear(); // an out-of-range old value is simply replaced
+      }
+      Ref fresh = py::integer(values[i]);
+      Ref old = Ref::steal(item);
+      PyTuple_SET_ITEM(t, i, fresh.release());
+    }
     return;
   }
   py::dict_set(q->f._fPerScanNameCounts, scan_name, make_count_pair(scans, locs));

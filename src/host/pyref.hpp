@@ -307,7 +307,8 @@ inline bool set_discard(Borrowed s, Borrowed key) {
 inline void list_append(Borrowed l, Borrowed v) { check_int(PyList_Append(l.get(), v.get())); }
 
 // Iterate any iterable: for_each(obj, [&](Borrowed item){...}).
-template <typename F> void for_each(Borrowed iterable, F &&f) {
+// for_each_while stops early when f returns false.
+template <typename F> void for_each_while(Borrowed iterable, F &&f) {
   Ref it = check(PyObject_GetIter(iterable.get()));
   for (;;) {
     Ref item = Ref::steal(PyIter_Next(it.get()));
@@ -316,8 +317,15 @@ template <typename F> void for_each(Borrowed iterable, F &&f) {
         throw_error();
       return;
     }
-    f(item.borrowed());
+    if (!f(item.borrowed()))
+      return;
   }
+}
+template <typename F> void for_each(Borrowed iterable, F &&f) {
+  for_each_while(iterable, [&](Borrowed item) {
+    f(item);
+    return true;
+  });
 }
 
 } // namespace py

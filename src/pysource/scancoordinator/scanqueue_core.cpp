@@ -255,11 +255,12 @@ Ref find_waiting_priority(Q *q, Borrowed loc) {
   unpack(entry, 2, parts);
   if (!parts[1].is_none())
     return parts[1];
-  py::Ref it = py::check(PyObject_GetIter(parts[0].get()));
-  Ref item = Ref::steal(PyIter_Next(it.get()));
+  Ref item;
+  py::for_each_while(parts[0], [&](Borrowed first) {
+    item = first.ref();
+    return false;
+  });
   if (!item) {
-    if (PyErr_Occurred())
-      py::throw_error();
     if (state->debug)
       assertion_failed(msg::kNotReached);
     return Ref();
@@ -324,17 +325,10 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
                       add_to_check, lp))
           ready.take(i);
     } else {
-      Ref it = py::check(PyObject_GetIter(pair_seq.get()));
-      for (;;) {
-        Ref pair = Ref::steal(PyIter_Next(it.get()));
-        if (!pair) {
-          if (PyErr_Occurred())
-            py::throw_error();
-          break;
-        }
+      py::for_each(pair_seq, [&](Borrowed pair) {
         if (sort_pair(q, pair, scan_name, prio, add_to_check, lp))
           ready.emplace_back(std::move(lp[0]), std::move(lp[1]));
-      }
+      });
     }
   } catch (const py::PyError &) {
     // The pairs before the bad one are queued all the same.

@@ -316,21 +316,15 @@ Ref fmt(Borrowed x) { return py::check(PyObject_Format(x.get(), nullptr)); }
 Py_ssize_t write_for_loc(Borrowed write, Borrowed loc, Borrowed name_list, Py_ssize_t loc_limit) {
   write_fmt(write, "  %U\n", py::check(PyObject_Repr(loc.get())));
   Py_ssize_t count = 1;
-  Ref it = py::check(PyObject_GetIter(name_list.get()));
-  for (;;) {
-    Ref name = Ref::steal(PyIter_Next(it.get()));
-    if (!name) {
-      if (PyErr_Occurred())
-        py::throw_error();
-      break;
-    }
+  py::for_each_while(name_list, [&](Borrowed name) {
     if (count >= loc_limit) {
       write_text(write, py::interned("    ...\n"));
-      break;
+      return false;
     }
     write_fmt(write, "    %U\n", fmt(name));
     count += 1;
-  }
+    return true;
+  });
   return count;
 }
 
@@ -355,22 +349,16 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
                                        fmt(scan_name).get(), sq->f.fPriority, om::size(uod)));
     write_text(write, line);
     if (count < limit) {
-      Ref it = py::check(PyObject_GetIter(om::items(uod).get()));
-      for (;;) {
-        Ref pair = Ref::steal(PyIter_Next(it.get()));
-        if (!pair) {
-          if (PyErr_Occurred())
-            py::throw_error();
-          break;
-        }
+      py::for_each_while(om::items(uod), [&](Borrowed pair) {
         if (count >= limit) {
           write_text(write, py::interned("  ...\n"));
-          break;
+          return false;
         }
         Ref parts[2];
         unpack(pair, 2, parts);
         count += write_for_loc(write, parts[0], parts[1], limit - count);
-      }
+        return true;
+      });
     } else {
       write_text(write, py::interned("  ...\n"));
     }

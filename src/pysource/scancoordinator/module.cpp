@@ -94,57 +94,46 @@ void exec_body(py::Borrowed module) {
     py::throw_error();
 
   auto *m = new host::Modules;
-  // 1. standard modules
-  struct {
-    const char *name;
-    py::Ref host::Modules::*slot;
-  } std_mods[] = {{"bisect", &host::Modules::bisect},
-                  {"collections", &host::Modules::collections},
-                  {"itertools", &host::Modules::itertools},
-                  {"sys", &host::Modules::sys},
-                  {"time", &host::Modules::time}};
-  for (auto &s : std_mods) {
-    m->*s.slot = import_module(s.name);
-    bind(dict, s.name, m->*s.slot);
-  }
-  // 2. host modules, each its own statement
-  struct {
+  // The imports, one statement each, in the order the host relies on:
+  // standard modules, host modules, then the engine's own package (kOwn).
+  // A null package is a plain `import name`; otherwise `from package import name`.
+  static const char *const kOwn = "";
+  using Slot = py::Ref host::Modules::*;
+  const struct {
     const char *package, *name;
-    py::Ref host::Modules::*slot;
-  } host_mods[] = {{"cache", "textcache", &host::Modules::textcache},
-                   {"guiutils", "ostrelgtk", &host::Modules::ostrelgtk},
-                   {"pysource", "logicalline", &host::Modules::logicalline},
-                   {"ostrelbase", "destroyable", &host::Modules::destroyable},
-                   {"ostrelbase", "location", &host::Modules::location},
-                   {"ostrelbase", "mime", &host::Modules::mime},
-                   {"ostrelutils", "callutils", &host::Modules::callutils},
-                   {"ostrelutils", "reflect", &host::Modules::reflect}};
-  for (auto &s : host_mods) {
-    m->*s.slot = import_from(s.package, s.name);
-    bind(dict, s.name, m->*s.slot);
-  }
-  m->config = import_module("config");
-  bind(dict, "config", m->config);
-  m->singleton = import_module("singleton");
-  bind(dict, "singleton", m->singleton);
-  // 3. the engine's own package
-  struct {
-    const char *name;
-    py::Ref host::Modules::*slot;
-  } pkg_mods[] = {{"analysis", &host::Modules::analysis},
-                  {"inferenceengine", &host::Modules::inferenceengine},
-                  {"inferencer", &host::Modules::inferencer},
-                  {"prefs", &host::Modules::prefs},
-                  {"scopescanner", &host::Modules::scopescanner},
-                  {"scopeinfo", &host::Modules::scopeinfo},
-                  {"symbolinfo", &host::Modules::symbolinfo},
-                  {"usageordereddict", &host::Modules::usageordereddict},
-                  {"utils", &host::Modules::utils},
-                  {"_fastaccess", &host::Modules::fastaccess},
-                  {"strutils", &host::Modules::strutils}};
-  for (auto &s : pkg_mods) {
-    m->*s.slot = import_from(pkg, s.name);
-    bind(dict, s.name, m->*s.slot);
+    Slot slot;
+  } imports[] = {{nullptr, "bisect", &host::Modules::bisect},
+                 {nullptr, "collections", &host::Modules::collections},
+                 {nullptr, "itertools", &host::Modules::itertools},
+                 {nullptr, "sys", &host::Modules::sys},
+                 {nullptr, "time", &host::Modules::time},
+                 {"cache", "textcache", &host::Modules::textcache},
+                 {"guiutils", "ostrelgtk", &host::Modules::ostrelgtk},
+                 {"pysource", "logicalline", &host::Modules::logicalline},
+                 {"ostrelbase", "destroyable", &host::Modules::destroyable},
+                 {"ostrelbase", "location", &host::Modules::location},
+                 {"ostrelbase", "mime", &host::Modules::mime},
+                 {"ostrelutils", "callutils", &host::Modules::callutils},
+                 {"ostrelutils", "reflect", &host::Modules::reflect},
+                 {nullptr, "config", &host::Modules::config},
+                 {nullptr, "singleton", &host::Modules::singleton},
+                 {kOwn, "analysis", &host::Modules::analysis},
+                 {kOwn, "inferenceengine", &host::Modules::inferenceengine},
+                 {kOwn, "inferencer", &host::Modules::inferencer},
+                 {kOwn, "prefs", &host::Modules::prefs},
+                 {kOwn, "scopescanner", &host::Modules::scopescanner},
+                 {kOwn, "scopeinfo", &host::Modules::scopeinfo},
+                 {kOwn, "symbolinfo", &host::Modules::symbolinfo},
+                 {kOwn, "usageordereddict", &host::Modules::usageordereddict},
+                 {kOwn, "utils", &host::Modules::utils},
+                 {kOwn, "_fastaccess", &host::Modules::fastaccess},
+                 {kOwn, "strutils", &host::Modules::strutils}};
+  for (const auto &imp : imports) {
+    if (!imp.package)
+      m->*imp.slot = import_module(imp.name);
+    else
+      m->*imp.slot = import_from(imp.package == kOwn ? pkg : imp.package, imp.name);
+    bind(dict, imp.name, m->*imp.slot);
   }
   host::modules = m;
   host::objectmodel::import_base();

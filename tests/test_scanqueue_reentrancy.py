@@ -5,10 +5,10 @@ and it must stay usable and destroyable afterwards."""
 import random
 
 import pytest
-
-import pysource.scancoordinator as sc
 from guiutils import ostrelgtk
 from ostrelbase import destroyable, location
+
+import pysource.scancoordinator as sc
 
 # What a re-entered queue may reasonably report.
 TOLERATED = (AssertionError, RuntimeError, KeyError, IndexError, ValueError, TypeError)

@@ -112,6 +112,18 @@ inline Borrowed self_of(C *c) { return Borrowed(reinterpret_cast<PyObject *>(c))
 ScanQueueObject *queue(C *c);
 // "None" for an unset field.
 inline Ref or_none(const Ref &r) { return r ? r : Ref::none(); }
+// A field or result that holds something other than None.
+inline bool has(const Ref &r) { return r && !r.is_none(); }
+// (a, b, ...) as a new tuple.
+template <typename... A> Ref tuple_of(A... items) {
+  return py::check(PyTuple_Pack(sizeof...(A), Borrowed(items).get()...));
+}
+// [(a, b)]: the one-pair list the queueing operations take.
+inline Ref one_pair_list(Borrowed a, Borrowed b) {
+  Ref list = py::check(PyList_New(1));
+  PyList_SET_ITEM(list.get(), 0, tuple_of(a, b).release());
+  return list;
+}
 
 // ---- lifecycle and idle scheduling ---------------------------------------
 void init(C *c, Borrowed idle_priority, Borrowed ana_mgr);

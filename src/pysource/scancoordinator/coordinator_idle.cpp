@@ -50,8 +50,6 @@ void log(C *c, const char *format, Borrowed value) {
 
 namespace {
 
-bool has(const Ref &r) { return r && !r.is_none(); }
-
 bool logging_on(C *c) {
   static Ref *s_out = new Ref(py::interned("fOutputFile"));
   return !py::getattr(c->f.fLog, *s_out).is_none();
@@ -77,10 +75,6 @@ double slice_budget() {
       return 0.05;
   }
   return 0.1;
-}
-
-Ref triple(Borrowed a, Borrowed b, Borrowed c) {
-  return py::check(PyTuple_Pack(3, a.get(), b.get(), c.get()));
 }
 
 bool is_python(C *c, Borrowed loc) {
@@ -225,14 +219,14 @@ void DoScans(C *c, double end_time) {
         if (recent < 0)
           py::throw_error();
         if (recent) {
-          log(c, msgs::kTooRecent, triple(loc, scope, scan_name));
+          log(c, msgs::kTooRecent, tuple_of(loc, scope, scan_name));
           sq::ScanCompleted(q, item);
           return;
         }
       }
     }
     if (!is_python(c, loc)) {
-      log(c, msgs::kNotPython, triple(loc, scope, scan_name));
+      log(c, msgs::kNotPython, tuple_of(loc, scope, scan_name));
       sq::RemoveScanTriple(q, loc, scope, scan_name, priority, true, Borrowed());
     } else {
       f.fActiveLoc = loc;
@@ -387,7 +381,7 @@ bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
   if (result)
     return true;
   py::call_method(f._fInfoCache, py::interned("FinishedWithScans"), loc, scope, scan_name);
-  Ref key = triple(loc, scope, scan_name);
+  Ref key = tuple_of(loc, scope, scan_name);
   Ref counts = f._fScanTripleCompletedCount;
   Ref old = py::dict_get(counts, key);
   Ref one = py::integer(1);

@@ -23,8 +23,6 @@ namespace scancoord::co {
 
 namespace {
 
-bool has(const Ref &r) { return r && !r.is_none(); }
-
 Ref resolve_priority(C *c, Borrowed first, Borrowed priority) {
   if (priority && !priority.is_none())
     return priority.ref();
@@ -33,8 +31,6 @@ Ref resolve_priority(C *c, Borrowed first, Borrowed priority) {
   const bool f = first ? py::truth(first) : true;
   return state->priorities[f ? kInteractivePriority : kBackgroundPriority];
 }
-
-Ref pair(Borrowed a, Borrowed b) { return py::check(PyTuple_Pack(2, a.get(), b.get())); }
 
 } // namespace
 
@@ -89,9 +85,9 @@ void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
       Ref scope = t[1];
       if (!py::truth(host::cachemgr::DoesCacheBufferExist(c->f.fCacheMgr, t[0])))
         scope = state->kWildcardScope;
-      py::list_append(primary, pair(t[0], scope));
+      py::list_append(primary, tuple_of(t[0], scope));
     } else if (py::eq(t[2], host::anamgr::DerivedScanName(c->f.fAnaMgr))) {
-      py::list_append(secondary, pair(t[0], t[1]));
+      py::list_append(secondary, tuple_of(t[0], t[1]));
     }
   });
   if (PyList_GET_SIZE(secondary.get()) != 0)
@@ -126,11 +122,11 @@ void CB_NeedsScanAdded(C *c, Borrowed, Borrowed needs_scan_added, Borrowed prior
       return;
     for (auto &g : groups)
       if (py::eq(g.first, t[2])) {
-        py::list_append(g.second, pair(t[0], t[1]));
+        py::list_append(g.second, tuple_of(t[0], t[1]));
         return;
       }
     groups.emplace_back(t[2], py::new_list());
-    py::list_append(groups.back().second, pair(t[0], t[1]));
+    py::list_append(groups.back().second, tuple_of(t[0], t[1]));
   });
   for (auto &g : groups)
     sq::AddScanPairs(queue(c), g.second, g.first, prio, false);
@@ -151,7 +147,7 @@ void CB_ActiveEditLinenoChanged(C *c, Borrowed ana, Borrowed new_lineno) {
     if (ne < 0)
       py::throw_error();
     if (ne)
-      py::list_append(pairs, pair(loc, scope));
+      py::list_append(pairs, tuple_of(loc, scope));
   });
   if (PyList_GET_SIZE(pairs.get()) == 0)
     return;
@@ -183,7 +179,7 @@ bool QueueBasicModules(C *c, Borrowed) {
     py::for_each(typing, [&](Borrowed loc) { py::list_append(locs, loc); });
   Ref pairs = py::new_list();
   for (Py_ssize_t i = 0; i < PyList_GET_SIZE(locs.get()); ++i)
-    py::list_append(pairs, pair(Borrowed(PyList_GET_ITEM(locs.get(), i)), py::interned("*")));
+    py::list_append(pairs, tuple_of(Borrowed(PyList_GET_ITEM(locs.get(), i)), py::interned("*")));
   call::AddPairsToPrimaryQueue(c, pairs, Borrowed(Py_True),
                                state->priorities[kTypingModulePriority]);
   c->f._fAllBasicModuleQueued = true;
@@ -207,7 +203,7 @@ void AddParseablesToQueue(C *c, Borrowed loc_seq, Borrowed priority) {
     if (in < 0)
       py::throw_error();
     if (in)
-      py::list_append(pairs, pair(kv.first, state->kWildcardScope));
+      py::list_append(pairs, tuple_of(kv.first, state->kWildcardScope));
   }
   if (PyList_GET_SIZE(pairs.get()) == 0)
     return;

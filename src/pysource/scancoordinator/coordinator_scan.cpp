@@ -28,8 +28,6 @@ constexpr const char *kStartSecondary = "Starting secondary whole file scan: %r"
 constexpr const char *kFinishSecondary = "Finished secondary whole file scan: %r";
 } // namespace msgs
 
-bool has(const Ref &r) { return r && !r.is_none(); }
-
 enum class Outcome { Waiting, Unfinished, Finished, Abandoned };
 
 Outcome run_slice(Borrowed scanner, double end_time) {
@@ -64,13 +62,6 @@ Ref new_scanner(const char *cls, std::initializer_list<PyObject *> args, Borrowe
   argv.push_back(incomplete.get());
   argv.push_back(log.get());
   return py::call_kw(type, argv.data(), args.size(), *kw);
-}
-
-Ref one_pair_list(Borrowed a, Borrowed b) {
-  Ref pair = py::check(PyTuple_Pack(2, a.get(), b.get()));
-  Ref list = py::check(PyList_New(1));
-  PyList_SET_ITEM(list.get(), 0, pair.release());
-  return list;
 }
 
 } // namespace

@@ -53,23 +53,12 @@ template <typename F> [[noreturn]] void rethrow_after(F &&cleanup) {
   throw py::PyError();
 }
 
-Ref triple_of(Borrowed a, Borrowed b, Borrowed c) {
-  return py::check(PyTuple_Pack(3, a.get(), b.get(), c.get()));
-}
-
 double time_time() {
   Ref t = py::call(py::getattr(host::modules->time, "time"));
   double v = PyFloat_AsDouble(t.get());
   if (v == -1.0 && PyErr_Occurred())
     py::throw_error();
   return v;
-}
-
-Ref one_pair_list(Borrowed a, Borrowed b) {
-  Ref pair = py::check(PyTuple_Pack(2, a.get(), b.get()));
-  Ref list = py::check(PyList_New(1));
-  PyList_SET_ITEM(list.get(), 0, pair.release());
-  return list;
 }
 
 // The first definition in `infos` of a method (bound or unbound), unpacked,
@@ -123,7 +112,7 @@ bool TryToScanDictNow(C *c, Borrowed, Borrowed, Borrowed needs_scan_set, double 
   py::for_each(needs, [&](Borrowed t) {
     Ref parts[3];
     unpack(t, 3, parts);
-    Ref triple = triple_of(parts[0], parts[1], parts[2]);
+    Ref triple = tuple_of(parts[0], parts[1], parts[2]);
     if (py::set_contains(active, triple))
       return;
     if (py::eq(parts[2], primary))

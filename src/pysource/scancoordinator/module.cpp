@@ -328,17 +328,23 @@ void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyOb
   }
 }
 
+namespace {
+// The ValueError of unpacking `size` values into `n` targets, if they differ.
+void check_unpack_size(Py_ssize_t size, Py_ssize_t n) {
+  if (size == n)
+    return;
+  if (size > n)
+    PyErr_Format(PyExc_ValueError, msg::kTooManyValues, n);
+  else
+    PyErr_Format(PyExc_ValueError, msg::kNotEnoughValues, n, size);
+  py::throw_error();
+}
+} // namespace
+
 void unpack(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
   PyObject *o = seq.get();
   if (PyTuple_CheckExact(o) || PyList_CheckExact(o)) {
-    Py_ssize_t size = PySequence_Fast_GET_SIZE(o);
-    if (size != n) {
-      if (size > n)
-        PyErr_Format(PyExc_ValueError, msg::kTooManyValues, n);
-      else
-        PyErr_Format(PyExc_ValueError, msg::kNotEnoughValues, n, size);
-      py::throw_error();
-    }
+    check_unpack_size(PySequence_Fast_GET_SIZE(o), n);
     PyObject **items = PySequence_Fast_ITEMS(o);
     for (Py_ssize_t i = 0; i < n; ++i)
       out[i] = py::Ref::borrow(items[i]);
@@ -382,14 +388,7 @@ void unpack_tuple(py::Borrowed seq, Py_ssize_t n, py::Ref *out) {
     py::throw_error();
   }
   PyObject *o = seq.get();
-  Py_ssize_t size = PyTuple_GET_SIZE(o);
-  if (size != n) {
-    if (size > n)
-      PyErr_Format(PyExc_ValueError, msg::kTooManyValues, n);
-    else
-      PyErr_Format(PyExc_ValueError, msg::kNotEnoughValues, n, size);
-    py::throw_error();
-  }
+  check_unpack_size(PyTuple_GET_SIZE(o), n);
   for (Py_ssize_t i = 0; i < n; ++i)
     out[i] = py::Ref::borrow(PyTuple_GET_ITEM(o, i));
 }

@@ -610,6 +610,7 @@ class CWholeFileSecondaryScanner(CScanner):
     def _Step(self, end_time: float) -> int:
         from pysource import inferencer
         if self._fPending is None:
+            self.fInfoCache.ResetDependencies(self.fLocation)
             infos = self.fInfoCache.GetScopeInfos(self.fLocation)
             self._fPending = collections.deque(infos[name] for name in sorted(infos))
         engine = inferencer.CInferencer(self.fAnaMgr)

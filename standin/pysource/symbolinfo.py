@@ -155,6 +155,8 @@ def NonNestedSplit(text: str | bytes, sep: str | bytes) -> list:
         codes = None
     if len(sep_b) != 1:
         raise ValueError('separator must be one character')
+    if (sep_b if is_bytes else sep_b.decode('latin-1')) not in text:
+        return [text[:]]  # the common case: one part
     sep_code = sep_b[0]
     parts = []
     depth = 0

@@ -169,6 +169,7 @@ class CInfoCache(destroyable.CDestroyable):
         self.fFinishedScanCount = 0
         # scan name -> [whole-file scans, single-scope scans] completed
         self.fFinishedScans: dict[str, list[int]] = {}
+        self.fLastFinished: Any = None
         # The database side (see infodb): the stored files' index by URL, the URLs
         # whose contents are not read yet, and who depends on whom (built on use).
         self._fDatabase: infodb.CInfoDatabase | None = None
@@ -427,6 +428,7 @@ class CInfoCache(destroyable.CDestroyable):
                           scan_name: str | None) -> None:
         """A scan completed: the parse of a file is released after its derived scan."""
         self.fFinishedScanCount += 1
+        self.fLastFinished = loc
         counts = self.fFinishedScans.get(scan_name)
         if counts is None:
             counts = self.fFinishedScans[scan_name] = [0, 0]
@@ -558,6 +560,10 @@ class CInfoCache(destroyable.CDestroyable):
             self._fStored[url] = (ids[url], json.loads(scans), nscopes)
         self._fStoredDependents = None
         self._fUrlsById = None
+
+    def DatabaseWasRebuilt(self) -> bool:
+        """Whether the database on disk was of another format and was emptied."""
+        return self._fDatabase is not None and self._fDatabase.fRebuilt
 
     def GetDatabaseStats(self) -> dict[str, int] | None:
         """Files and scopes in the database and its size in bytes (None without one)."""

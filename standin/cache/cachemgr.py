@@ -3,7 +3,9 @@
 Scanners read source through ``GetSourceForScan``: the open buffer's text when
 the file is open, else the file's contents with line endings normalised.  The
 latter are cached per file and modification time (the "EOL-blind" cache), which
-``_ClearEOLBlindCacheAndScans`` empties.
+``_ClearEOLBlindCacheAndScans`` empties.  A file that cannot be read as source
+(gone, not a regular file, unreadable, not decodable in its encoding) gives
+None, and the reason is kept in ``fReadProblems`` until the file reads well.
 """
 from __future__ import annotations
 
@@ -14,6 +16,11 @@ from ostrelbase import destroyable
 from cache import textcache
 from pysource import strutils
 
+kVanished = 'vanished'
+kNotAFile = 'not a regular file'
+kUnreadable = 'unreadable'
+kUndecodable = 'undecodable'
+
 
 class CCacheManager(destroyable.CDestroyable):
     kSignals = ('buffer-opened', 'buffer-closed')
@@ -23,6 +30,8 @@ class CCacheManager(destroyable.CDestroyable):
         self._fBuffers: dict[Any, textcache.CTextCache] = {}
         self._fAnalyses: dict[Any, Any] = {}
         self._fEOLBlind: dict[Any, tuple[float, str]] = {}
+        # loc -> (kind, detail): why the file's source could not be read
+        self.fReadProblems: dict[Any, tuple[str, str]] = {}
 
     # -- buffers -------------------------------------------------------------------
 
@@ -77,19 +86,34 @@ class CCacheManager(destroyable.CDestroyable):
         buf = self._fBuffers.get(loc)
         if buf is not None:
             return buf.GetText(), (None if buf.IsModified() else buf._GetLastKnownModTime())
+        # The time is taken before the contents: a file that changes in between is
+        # stored with the older time and so counts as changed next time.
         st = loc.GetStat()
-        if not st.exists or st.is_dir:
-            return None
+        if not st.exists:
+            return self._Problem(loc, kVanished, 'no longer exists')
+        if st.is_dir or not st.is_file:
+            return self._Problem(loc, kNotAFile, 'not a regular file')
         cached = self._fEOLBlind.get(loc)
         if cached is not None and cached[0] == st.mtime:
             return cached[1], st.mtime
         try:
             data = loc.ReadBytes()
-        except OSError:
-            return None
-        text = strutils.NormalizeEOLs(strutils.DecodeSource(data))
+        except FileNotFoundError:
+            return self._Problem(loc, kVanished, 'vanished while being read')
+        except OSError as exc:
+            return self._Problem(loc, kUnreadable, exc.strerror or str(exc))
+        try:
+            text = strutils.DecodeSource(data, strict=True)
+        except (UnicodeDecodeError, LookupError, SyntaxError) as exc:
+            return self._Problem(loc, kUndecodable, strutils.DescribeDecodeError(exc))
+        text = strutils.NormalizeEOLs(text)
+        self.fReadProblems.pop(loc, None)
         self._fEOLBlind[loc] = (st.mtime, text)
         return text, st.mtime
+
+    def _Problem(self, loc: Any, kind: str, detail: str) -> None:
+        self.fReadProblems[loc] = (kind, detail)
+        self._fEOLBlind.pop(loc, None)
 
     def _ClearEOLBlindCacheAndScans(self) -> None:
         """Forget the cached file texts (and so any scan state built on them)."""

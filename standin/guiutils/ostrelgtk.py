@@ -230,16 +230,22 @@ class CMainLoop:
         if self._fQuitFlags:
             self._fQuitFlags[-1][0] = True
 
-    def run_until_idle(self, max_iterations: int = 10000) -> bool:
-        """Dispatch until no idle source is pending, at most ``max_iterations`` times.
+    def run_until_idle(self, max_iterations: int = 10000,
+                       stop: Callable[[], bool] | None = None) -> bool:
+        """Dispatch until no idle source is pending, at most ``max_iterations`` times,
+        and (with ``stop``) only while ``stop()`` is false: checked before each
+        dispatch, so a signal handler that sets a flag stops the loop between two
+        callbacks.
 
         Due timeouts run too (by priority).  Returns True when no idle is pending at
-        the end, False when the bound was hit or the pending idles cannot run (for
-        example the one whose callback called this).
+        the end, False when the bound was hit, ``stop()`` became true or the pending
+        idles cannot run (for example the one whose callback called this).
         """
         for _ in range(max_iterations):
             if not self._HasPendingIdle():
                 return True
+            if stop is not None and stop():
+                return False
             if not self.iteration(False):
                 return False
         return not self._HasPendingIdle()
@@ -419,8 +425,9 @@ def quit() -> None:
     _gLoop.quit()
 
 
-def run_until_idle(max_iterations: int = 10000) -> bool:
-    return _gLoop.run_until_idle(max_iterations)
+def run_until_idle(max_iterations: int = 10000,
+                   stop: Callable[[], bool] | None = None) -> bool:
+    return _gLoop.run_until_idle(max_iterations, stop)
 
 
 def set_clock(clock: Callable[[], float] | None) -> None:

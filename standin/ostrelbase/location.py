@@ -21,6 +21,7 @@ from __future__ import annotations
 
 import os
 import posixpath
+import stat
 from collections.abc import Callable, Iterable
 from typing import Any, NamedTuple
 
@@ -39,9 +40,10 @@ class CStatInfo(NamedTuple):
     is_dir: bool
     mtime: float
     size: int
+    is_file: bool = True  # a regular file (not a directory, pipe, socket or device)
 
 
-kMissingStat = CStatInfo(False, False, 0.0, 0)
+kMissingStat = CStatInfo(False, False, 0.0, 0, False)
 
 
 class CLocation:
@@ -129,7 +131,8 @@ class CLocalFileLocation(CLocation):
             st = os.stat(self.fPath)
         except OSError:
             return kMissingStat
-        return CStatInfo(True, os.path.isdir(self.fPath), st.st_mtime, st.st_size)
+        return CStatInfo(True, stat.S_ISDIR(st.st_mode), st.st_mtime, st.st_size,
+                         stat.S_ISREG(st.st_mode))
 
     def ReadBytes(self) -> bytes:
         with open(self.fPath, 'rb') as f:

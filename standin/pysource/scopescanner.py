@@ -57,9 +57,17 @@ kUnsavedMTime = -2.0
 def ParseTolerant(text: str) -> tuple[ast.Module, set[int], bool]:
     """Parse ``text``; lines with syntax errors are replaced by ``pass`` until it
     parses.  Returns (tree, replaced line numbers, whether parsing failed outright).
-    The line count never changes, so positions in the tree match ``text``."""
+    The line count never changes, so positions in the tree match ``text``.  Lines
+    holding a NUL character (which the parser refuses outright) are replaced
+    first."""
     lines = text.split('\n')
     patched: set[int] = set()
+    if '\0' in text:
+        for i, line in enumerate(lines):
+            if '\0' in line:
+                indent = line[:len(line) - len(line.lstrip(' \t'))]
+                lines[i] = indent + 'pass'
+                patched.add(i + 1)
     for _attempt in range(kMaxParseRepairs + 1):
         try:
             return ast.parse('\n'.join(lines)), patched, False

@@ -7,18 +7,37 @@ def NormalizeEOLs(text: str) -> str:
     return text.replace('\r\n', '\n').replace('\r', '\n')
 
 
-def DecodeSource(data: bytes) -> str:
-    """Decode Python source bytes: a BOM or coding cookie, else UTF-8 (lenient)."""
+def DecodeSource(data: bytes, strict: bool = False) -> str:
+    """Decode Python source bytes: a BOM or coding cookie, else UTF-8.
+
+    Lenient by default (undecodable bytes become U+FFFD); with ``strict`` a bad
+    cookie raises SyntaxError or LookupError and bad bytes UnicodeDecodeError,
+    as they make the file unimportable.
+    """
     import io
     import tokenize
     try:
         encoding, _lines = tokenize.detect_encoding(io.BytesIO(data).readline)
     except SyntaxError:
+        if strict:
+            raise
         encoding = 'utf-8'
     try:
-        return data.decode(encoding)
+        text = data.decode(encoding)
     except (LookupError, UnicodeDecodeError):
+        if strict:
+            raise
         return data.decode('utf-8', 'replace')
+    return text
+
+
+def DescribeDecodeError(exc: BaseException) -> str:
+    """A one-line reason for a ``DecodeSource(strict=True)`` failure."""
+    if isinstance(exc, UnicodeDecodeError):
+        return f'invalid {exc.encoding} byte 0x{exc.object[exc.start]:02x} at offset {exc.start}'
+    if isinstance(exc, LookupError):
+        return f'unknown encoding ({exc})'
+    return str(exc)
 
 
 def StrInStr(needle: str, haystack: str) -> bool:

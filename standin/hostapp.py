@@ -179,6 +179,13 @@ def CreateScanCoordinator(app: CApplication,
                                              ana_mgr.fDerivedScanName: 1})
     ana_mgr.fScanCoordinator = coordinator
     app.fCoordinator = coordinator
+    # The scan queue follows the GUI manager's active document from the moment
+    # the singletons announce a GUI manager; in this application the GUI exists
+    # before the coordinator, so announce it again (as an application whose GUI
+    # comes up after its analysis engine does).
+    sing = app.fSingletons
+    if sing.fGuiMgr is not None:
+        sing.Set('fGuiMgr', sing.fGuiMgr)
     return coordinator
 
 

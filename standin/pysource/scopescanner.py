@@ -576,9 +576,14 @@ class CSingleScopePrimaryScanner(_CPrimaryScanner):
                          log, ana_mgr)
 
     def _Step(self, end_time: float) -> int:
-        state = self._Prepare()
-        if state is not None:
-            return state
+        # Two units of work: reading and parsing, then building the scope's
+        # information; a deadline that passes in between ends the first call.
+        if self._fRecords is None:
+            state = self._Prepare()
+            if state is not None:
+                return state
+            if _OutOfTime(end_time):
+                return kTimedOut
         assert self._fRecords is not None and self._fSegments is not None
         by_name = {rec.fName: rec for rec in self._fRecords}
         rec = by_name.get(self.fScopeName)

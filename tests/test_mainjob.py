@@ -201,7 +201,7 @@ def test_a_signal_stops_the_scan_cleanly_and_the_next_run_goes_on(tmp_path, sign
     try:
         # Progress lines come once a second: stop it once some files are done.
         for line in proc.stdout:
-            found = re.search(r'primary scans (\d+) done', line)
+            found = re.search(r'primary (\d+) done', line)
             if found and int(found.group(1)) > 5:
                 break
         else:
@@ -340,3 +340,28 @@ def test_bad_directory_or_database_gives_one_line(tmp_path, arrange, status, mes
     assert 'Traceback' not in out
     if arrange in (garbage, read_only):
         assert db.read_bytes() == before
+
+
+def test_module_lookup_through_listings_finds_what_stat_finds(tmp_path, fresh_loop):
+    """The factory tries candidate files against cached directory listings; the
+    answers must be those of asking the file system for each candidate."""
+    from pysource import analysismgr
+    for rel in ('a.py', 'a.pyi', 'p/__init__.py', 'p/q.pyi', 'p/r/__init__.pyi', 's.so',
+                'stub_only.pyi', 'd.py/__init__.py', 'p/a.py'):
+        (tmp_path / rel).parent.mkdir(parents=True, exist_ok=True)
+        (tmp_path / rel).write_text('')
+    os.symlink('missing', tmp_path / 'gone.py')
+    os.symlink('p', tmp_path / 'linked')
+    app = hostapp.CreateApplication(str(tmp_path / 'p'), db_path=None,
+                                    python_path=[str(tmp_path)])
+    factory = app.fAnaMgr.fAnalysisFactory
+    names = ['a', 'p', 'p.q', 'p.r', 'p.a', 's', 'stub_only', 'd', 'd.py', 'gone', 'linked.q',
+             'linked', 'nothing', 'p.nothing', '', 'a..b', 'p.r.x']
+    for dirloc in (None, app.fProjectDir, app.fProjectDir.Join('r')):
+        for name in names:
+            for ext in (False, True):
+                for base in factory._SearchDirs(dirloc):
+                    expected = next((c for c in factory._Candidates(base, name, ext)
+                                     if analysismgr._Exists(c)), None)
+                    assert factory._FindIn(base, name, ext) == expected, (base, name, ext)
+    app.Shutdown()

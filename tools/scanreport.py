@@ -156,10 +156,11 @@ class CPlainProgress:
     def Update(self, p: CProgress) -> None:
         parts = []
         for row in p.rows:
+            label = row.label.removesuffix(' scans')
             if row.done is None:
-                parts.append(f'{row.label} {row.left:,}')
+                parts.append(f'{label} {row.left:,}')
             else:
-                parts.append(f'{row.label} {row.done:,} done, {row.left:,} left')
+                parts.append(f'{label} {row.done:,} done, {row.left:,} left')
         rate = f'{p.scans_per_second:,.0f} scans/s' if p.scans_per_second is not None else '- scans/s'
         parts.append(rate)
         parts.append(f'about {FormatSeconds(p.eta)} left' if p.eta is not None else 'time left unknown')

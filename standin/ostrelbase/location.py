@@ -117,11 +117,19 @@ class CLocalFileLocation(CLocation):
     __slots__ = ('fPath',)
 
     def __init__(self, path: str) -> None:
-        self.fPath = os.path.normpath(os.path.abspath(os.fspath(path)))
+        self.fPath = os.path.abspath(os.fspath(path))  # normalised too
         self.fUrl = kLocalScheme + self.fPath
 
+    @classmethod
+    def _FromNormalPath(cls, path: str) -> CLocalFileLocation:
+        """A location for an absolute path that is already normalised."""
+        loc = cls.__new__(cls)
+        loc.fPath = path
+        loc.fUrl = kLocalScheme + path
+        return loc
+
     def GetParentDir(self) -> CLocalFileLocation:
-        return CLocalFileLocation(os.path.dirname(self.fPath))
+        return self._FromNormalPath(os.path.dirname(self.fPath))
 
     def IsReady(self) -> bool:
         return True
@@ -145,7 +153,7 @@ class CLocalFileLocation(CLocation):
             return []
 
     def Join(self, *names: str) -> CLocalFileLocation:
-        return CLocalFileLocation(os.path.join(self.fPath, *names))
+        return self._FromNormalPath(os.path.normpath(os.path.join(self.fPath, *names)))
 
 
 class CRemoteFileLocation(CLocation):

@@ -70,13 +70,44 @@ def _Exists(loc: Any) -> bool:
     return loc.Exists()
 
 
+def _NamesEntries(dotted: str) -> bool:
+    """Whether each part of a dotted name is a plain directory entry name (as the
+    parts of module names are), so candidates need no path normalising."""
+    return not dotted or all(p and p not in ('.', '..') and os.sep not in p
+                             for p in dotted.split('.'))
+
+
 class CModFileCache(destroyable.CDestroyable):
-    """Module name lookups per directory: (name, dir url) -> location or None."""
+    """Module name lookups per directory: (name, dir url) -> location or None.
+
+    Local directories' listings are cached too (``Listing``), so that looking for
+    a module tries its candidate file names against a set instead of asking the
+    file system for each; a listed name is still confirmed with ``stat`` (a
+    broken link is listed but does not exist).  Both caches are emptied by
+    ``Clear`` and ``Suspend``."""
 
     def __init__(self) -> None:
         super().__init__(('suspend', 'unsuspend'))
         self._fLookups: dict[tuple[str, str], Any] = {}
+        self._fListings: dict[str, frozenset[str] | None] = {}
+        self._fFound: dict[tuple[str, str, bool], Any] = {}
         self.fSuspendCount = 0
+
+    def Listing(self, path: str) -> frozenset[str] | None:
+        """The names in local directory ``path`` (empty when it cannot be listed
+        because it is missing or not a directory; None when listing is refused,
+        so the caller asks for each name)."""
+        listing = self._fListings.get(path, False)
+        if listing is False:
+            try:
+                listing = frozenset(os.listdir(path))
+            except (FileNotFoundError, NotADirectoryError):
+                listing = frozenset()
+            except OSError:
+                listing = None
+            if self.fSuspendCount == 0:
+                self._fListings[path] = listing
+        return listing
 
     def Get(self, name: str, dirloc: Any) -> tuple[bool, Any]:
         key = (name, dirloc.fUrl)
@@ -90,12 +121,14 @@ class CModFileCache(destroyable.CDestroyable):
 
     def Clear(self) -> None:
         self._fLookups.clear()
+        self._fListings.clear()
+        self._fFound.clear()
 
     def Suspend(self) -> None:
         """Stop caching (the file system or the path is changing)."""
         self.fSuspendCount += 1
         if self.fSuspendCount == 1:
-            self._fLookups.clear()
+            self.Clear()
             self.emit('suspend', self)
 
     def Unsuspend(self) -> None:
@@ -199,9 +232,56 @@ class CAnalysisFactory(destroyable.CDestroyable):
         else:
             bases = self._SearchDirs(dirloc)
         for base in bases:
-            for candidate in self._Candidates(base, rel, include_extensions):
-                if _Exists(candidate):
-                    return candidate
+            found = self._FindIn(base, rel, include_extensions)
+            if found is not None:
+                return found
+        return None
+
+    def _FindIn(self, base: Any, dotted: str, include_extensions: bool) -> Any:
+        """The first of ``_Candidates(base, dotted)`` that exists, or None."""
+        if isinstance(base, location.CLocalFileLocation):
+            cache = self._fModFileCache
+            key = (base.fPath, dotted, include_extensions)
+            found = cache._fFound.get(key, False)
+            if found is not False:
+                return found
+            if _NamesEntries(dotted):
+                found = self._FindInLocalDir(base.fPath, dotted, include_extensions)
+                if cache.fSuspendCount == 0:
+                    cache._fFound[key] = found
+                return found
+        for candidate in self._Candidates(base, dotted, include_extensions):
+            if _Exists(candidate):
+                return candidate
+        return None
+
+    def _FindInLocalDir(self, base: str, dotted: str, include_extensions: bool) -> Any:
+        """``_FindIn`` for a local directory, with its candidates tried against
+        directory listings: the same candidates in the same order."""
+        listing = self._fModFileCache.Listing
+        if dotted:
+            parts = dotted.split('.')
+            parent = os.path.join(base, *parts[:-1])
+            leaf = parts[-1]
+            candidates = [(parent, leaf + suffix) for suffix in kSourceSuffixes]
+            parent_names = listing(parent)
+            if parent_names is None or leaf in parent_names:  # else no package dir
+                pkg = os.path.join(parent, leaf)
+                candidates += [(pkg, '__init__' + suffix) for suffix in kSourceSuffixes]
+            if include_extensions:
+                candidates.append((parent, leaf + '.so'))
+        else:
+            candidates = [(base, '__init__' + suffix) for suffix in kSourceSuffixes]
+        for directory, name in candidates:
+            names = listing(directory)
+            if names is not None and name not in names:
+                continue
+            path = os.path.join(directory, name)
+            try:
+                os.stat(path)
+            except OSError:
+                continue
+            return location.CLocalFileLocation._FromNormalPath(path)
         return None
 
     def _SearchDirs(self, dirloc: Any) -> list[Any]:

@@ -197,7 +197,7 @@ class CInfoDatabase:
 
     # -- writing -------------------------------------------------------------------
 
-    def Write(self, new_urls: list[str], rows: list[tuple], deleted: list[int],
+    def Write(self, new_urls: list[str], rows: Iterable[tuple], deleted: list[int],
               known_ids: dict[str, int]) -> None:
         """One transaction: add ``new_urls`` to ``files`` (their ids are stored in
         ``known_ids``), then write ``rows`` of (url, scans JSON, nscopes, imports,
@@ -224,7 +224,7 @@ class CInfoDatabase:
                 conn.execute('DELETE FROM files WHERE id = ?', (fid,))
                 conn.execute('DELETE FROM contents WHERE id = ?', (fid,))
             conn.execute('COMMIT')
-        except (sqlite3.Error, OSError) as exc:
+        except BaseException as exc:
             for url in added:
                 known_ids.pop(url, None)
             if conn.in_transaction:
@@ -232,4 +232,6 @@ class CInfoDatabase:
                     conn.execute('ROLLBACK')
                 except sqlite3.Error:
                     pass
-            raise CDatabaseError(_Describe(exc, self.fPath)) from None
+            if isinstance(exc, (sqlite3.Error, OSError)):
+                raise CDatabaseError(_Describe(exc, self.fPath)) from None
+            raise

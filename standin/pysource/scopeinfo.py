@@ -541,23 +541,25 @@ class CInfoCache(destroyable.CDestroyable):
                 needed.extend(d.fUrl for d in deps)
             rows.append((loc, infos, scans, derived, deps))
         new_urls = list(dict.fromkeys(u for u in needed if u not in self._fIds))
-        encoded = []
-        for loc, infos, scans, derived, deps in rows:
-            imports = [[scope, eq.decode('utf-8', 'surrogateescape')]
-                       for _loc, scope, eq in self._Imports(loc, infos)]
-            data = EncodeFileData(loc, infos, derived, self.fPrimaryScanName)
-            encoded.append((loc.fUrl, json.dumps(scans), len(infos), infodb.Pack(imports),
-                            infodb.Pack(data),
-                            None if deps is None else sorted(d.fUrl for d in deps)))
+        written: list[tuple[str, dict[str, float], int]] = []
+
+        def encoded():  # one file at a time: the write never holds them all
+            for loc, infos, scans, derived, deps in rows:
+                imports = [[scope, eq.decode('utf-8', 'surrogateescape')]
+                           for _loc, scope, eq in self._Imports(loc, infos)]
+                data = EncodeFileData(loc, infos, derived, self.fPrimaryScanName)
+                written.append((loc.fUrl, dict(scans), len(infos)))
+                yield (loc.fUrl, json.dumps(scans), len(infos), infodb.Pack(imports),
+                       infodb.Pack(data), None if deps is None else sorted(d.fUrl for d in deps))
         ids = self._fIds
-        db.Write(new_urls, encoded, deleted, ids)
+        db.Write(new_urls, encoded(), deleted, ids)
         if deleted:
             gone = set(deleted)
             for url in [u for u, fid in ids.items() if fid in gone]:
                 del ids[url]
                 self._fStored.pop(url, None)
-        for url, scans, nscopes, *_rest in encoded:
-            self._fStored[url] = (ids[url], json.loads(scans), nscopes)
+        for url, scans, nscopes in written:
+            self._fStored[url] = (ids[url], scans, nscopes)
         self._fStoredDependents = None
         self._fUrlsById = None
 

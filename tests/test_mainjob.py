@@ -1,4 +1,5 @@
 """The main job as a product: the database, the scan command, bad input, interruption."""
+import io
 import json
 import os
 import re
@@ -7,6 +8,7 @@ import sqlite3
 import subprocess
 import sys
 import time
+import types
 
 import hostapp
 import pytest
@@ -179,6 +181,43 @@ def test_rerun_skips_unchanged_files_and_rescans_what_depends_on_a_change(tmp_pa
     status, third, _out, _err = run_scan(root, db)
     assert (third['files']['scanned'], third['files']['up_to_date']) == (1, 3)
     assert third['scans'] | {'primary_whole_file': 1, 'derived_whole_file': 2} == third['scans']
+
+
+def test_progress_figures_per_queue_rate_over_recent_history_and_time_left(monkeypatch):
+    sys.path.insert(0, os.path.join(ROOT, 'tools'))
+    import scanreport
+    ns = types.SimpleNamespace
+    finished = {}
+    cache = ns(fFinishedScans=finished, fLastFinished=location.CLocalFileLocation('/r/b.py'))
+    app = ns(fAnaMgr=ns(fInfoCache=cache, fPrimaryScanName='p', fDerivedScanName='d'))
+    coord = ns(_CScanCoordinator__fActiveLoc=location.CLocalFileLocation('/r/sub/a.py'))
+    clock = iter([10.0, 11.0, 13.0, 30.0])
+    monkeypatch.setattr(scanreport.time, 'perf_counter', lambda: next(clock))
+    tracker = scanreport.CProgressTracker(app, coord, '/r', 9.0)
+
+    def snapshot(primary_done, derived_done):
+        finished.update(p=[primary_done, 1], d=[derived_done, 0])
+        queues = [ns(scan_name='p', priority=1, file_count=3),
+                  ns(scan_name='p', priority=2, file_count=7),
+                  ns(scan_name='d', priority=2, file_count=5)]
+        return tracker.Snapshot(ns(queue_status_list=queues, waiting_count=2))
+
+    first = snapshot(0, 0)
+    assert (first.done, first.left, first.scans_per_second, first.eta) == (1, 17, None, None)
+    second = snapshot(3, 1)
+    assert [(r.label, r.done, r.left, r.detail) for r in second.rows] == [
+        ('primary scans', 4, 10, 'p1 3 · p2 7'), ('derived scans', 1, 5, 'p2 5'),
+        ('waiting for data', None, 2, '')]
+    assert (second.elapsed, second.scans_per_second, second.eta) == (2.0, 4.0, 17 / 4)
+    assert second.current == 'sub/a.py'
+    out = io.StringIO()
+    scanreport.CPlainProgress(out).Update(second)
+    assert out.getvalue() == ('[    2.0s] primary 4 done, 10 left · derived 1 done, 5 left · '
+                              'waiting for data 2 · 4 scans/s · about 4.2 s left · sub/a.py\n')
+    snapshot(9, 5)
+    coord._CScanCoordinator__fActiveLoc = None  # between two files: the last one finished
+    last = snapshot(20, 8)  # the rate forgets what is older than its window
+    assert (last.scans_per_second, last.current) == ((29 - 15) / (30 - 13), 'b.py')
 
 
 def many_files(root, count):

@@ -12,7 +12,9 @@ Workloads, on LOCATIONS files x 3 scope names under one scan name:
              process each time so that memory freed by earlier runs cannot hide it
 
 Each workload runs on a fresh queue per repetition; the table shows medians.  The
-garbage collector is off while a workload is timed (as timeit does) unless --gc.
+garbage collector is off while a workload is timed (as timeit does) unless --gc; with
+--gc the collections each workload triggered are shown per generation (gen2 is a full
+collection: a walk over the whole heap).
 """
 import argparse
 import gc
@@ -65,22 +67,26 @@ class Bench:
         self.pairs = make_pairs(self.locs)
         self.keep_gc = keep_gc
         self.cache = FakeLocationDataCache()
+        self.collections = {}
 
     def new_queue(self):
         q = self.module._CScanQueue(self.cache)
         q.SetScansToOrder({kScanName: 0})
         return q
 
-    def timed(self, fn):
+    def timed(self, name, fn):
         gc.collect()
         if not self.keep_gc:
             gc.disable()
         try:
+            before = [g['collections'] for g in gc.get_stats()]
             t0 = time.perf_counter_ns()
             fn()
             elapsed = time.perf_counter_ns() - t0
+            after = [g['collections'] for g in gc.get_stats()]
         finally:
             gc.enable()
+        self.collections.setdefault(name, []).append(tuple(a - b for a, b in zip(after, before)))
         ostrelgtk.run_until_idle()
         return elapsed / len(self.pairs)
 
@@ -89,9 +95,9 @@ class Bench:
         pairs = self.pairs
         q = self.new_queue()
         result = {}
-        result['add'] = self.timed(lambda: q.AddScanPairs(pairs, kScanName, 2, True))
+        result['add'] = self.timed('add', lambda: q.AddScanPairs(pairs, kScanName, 2, True))
         assert q.GetFileCount(kScanName, 2) == len(self.locs)
-        result['promote'] = self.timed(lambda: q.AddScanPairs(pairs, kScanName, 1, True))
+        result['promote'] = self.timed('promote', lambda: q.AddScanPairs(pairs, kScanName, 1, True))
         assert q.GetFileCount(kScanName, 1) == len(self.locs)
         assert q.GetFileCount(kScanName, 2) == 0
 
@@ -103,11 +109,11 @@ class Bench:
                     break
                 ScanCompleted(item)
 
-        result['drain'] = self.timed(drain)
+        result['drain'] = self.timed('drain', drain)
         assert q.Empty()
         q.AddScanPairs(pairs, kScanName, 2, True)
         ostrelgtk.run_until_idle()
-        result['remove'] = self.timed(lambda: q.RemoveAllForLocations(self.locs))
+        result['remove'] = self.timed('remove', lambda: q.RemoveAllForLocations(self.locs))
         assert q.Empty()
         q.destroy()
         ostrelgtk.run_until_idle()
@@ -163,8 +169,10 @@ def main(argv):
     impls = args.impl or ['compiled', 'reference']
 
     medians = {}
+    collections = {}
     for impl in impls:
         bench = Bench(load(impl), args.locations, args.gc)
+        collections[impl] = bench.collections
         runs = [bench.run_once() for _ in range(args.repeat)]
         medians[impl] = {w: statistics.median(r[w] for r in runs) for w in runs[0]}
         medians[impl]['memory'] = statistics.median(
@@ -194,6 +202,13 @@ def main(argv):
         print('  '.join(str(cell).rjust(w) if i else str(cell).ljust(w)
                         for i, (cell, w) in enumerate(zip(row, widths))))
     print('ratio: reference / compiled.  memory column: bytes of resident set per queued scan.')
+    if args.gc:
+        print('collections while timed (gen0/gen1/gen2, median over runs):')
+        for impl in impls:
+            print(f'  {impl}: ' + ', '.join(
+                f'{w} ' + '/'.join(f'{statistics.median(c[i] for c in counts):g}'
+                                   for i in range(3))
+                for w, counts in collections[impl].items()))
     if 'compiled' in medians:
         print('compiled misses target: ' + (', '.join(missed) if missed else 'none'))
     return 0

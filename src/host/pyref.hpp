@@ -18,7 +18,6 @@
 #include <cstdint>
 #include <cstring>
 #include <exception>
-#include <unordered_map>
 #include <utility>
 
 namespace py {
@@ -161,26 +160,22 @@ inline void translate_exception() noexcept {
 
 inline Ref str(const char *s) { return check(PyUnicode_FromString(s)); }
 
-// The interned str of a constant C string (an attribute, signal or message
-// name), created once and kept for the life of the process: hot paths look
-// names up without building a new string each time.  The cache is keyed by
-// the literal's address and checked against its text, so a reused buffer
-// can never return a stale name.  Called with the GIL held, like all of this.
-inline PyObject *intern_cached(const char *s) {
-  static auto *cache = new std::unordered_map<const char *, PyObject *>();
-  auto it = cache->find(s);
-  if (it != cache->end()) {
-    const char *text = PyUnicode_AsUTF8(it->second);
-    if (text && std::strcmp(text, s) == 0)
-      return it->second;
-  }
-  PyObject *u = PyUnicode_InternFromString(s);
-  if (!u)
-    throw_error();
-  (*cache)[s] = u; // a replaced entry stays alive: someone may still borrow it
-  return u;
-}
-inline Ref interned(const char *s) { return Ref::borrow(intern_cached(s)); }
+// A new reference to the interned str of `s`.  Interning decodes the text
+// and looks it up in the interpreter's table, so this is for one-time setup;
+// code that runs repeatedly names things with PY_NAME.
+inline Ref intern(const char *s) { return check(PyUnicode_InternFromString(s)); }
+
+// The interned str of a constant text (an attribute, method, signal or
+// message name), made the first time this call site runs and kept for the
+// life of the process: afterwards naming it costs one load, with no
+// conversion or comparison of C strings.  `text` must be a constant
+// expression; a failed first creation throws and is retried next time.
+#define PY_NAME(text)                                                                              \
+  (::py::Borrowed([]() -> PyObject * {                                                             \
+    static PyObject *const name_ = ::py::intern(text).release();                                   \
+    return name_;                                                                                  \
+  }()))
+
 inline Ref integer(long long v) { return check(PyLong_FromLongLong(v)); }
 inline Ref floating(double v) { return check(PyFloat_FromDouble(v)); }
 
@@ -197,9 +192,6 @@ inline bool truth(Borrowed o) {
 
 inline Ref getattr(Borrowed o, Borrowed name) {
   return check(PyObject_GetAttr(o.get(), name.get()));
-}
-inline Ref getattr(Borrowed o, const char *name) {
-  return check(PyObject_GetAttr(o.get(), intern_cached(name)));
 }
 inline void setattr(Borrowed o, Borrowed name, Borrowed v) {
   check_int(PyObject_SetAttr(o.get(), name.get(), v.get()));

@@ -7,8 +7,8 @@
 namespace host::scanners {
 
 // A state constant of pysource.scopescanner (kWaitingForData, ...).
-py::Ref State(const char *name);
+py::Ref State(py::Borrowed name);
 // A scanner class of pysource.scopescanner.
-py::Ref Class(const char *name);
+py::Ref Class(py::Borrowed name);
 
 } // namespace host::scanners

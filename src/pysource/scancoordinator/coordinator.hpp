@@ -156,8 +156,8 @@ bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 
 // ---- idle loop -------------------------------------------------------------
 double now_time();
-void log(C *c, const char *message);
-void log(C *c, const char *format, Borrowed value);
+void log(C *c, Borrowed message);
+void log(C *c, Borrowed format, Borrowed value);
 PyObject *CB_DoIdleAnalysis(C *c); // True, False or None; NULL with an exception
 void DoScans(C *c, double end_time);
 bool CheckWholeFiles(C *c, double end_time);

@@ -85,12 +85,16 @@ constexpr const char *kInterpreterChange = "Interpreter change detected - this m
                                            "loaded into one interpreter per process.";
 } // namespace msg
 
-// Argument parsing for METH_FASTCALL | METH_KEYWORDS methods.  `names` has
-// `total` entries, the first `required` of which are mandatory; `out` receives
+// Argument parsing for METH_FASTCALL | METH_KEYWORDS methods.  `keys` holds
+// the `total` parameter names as interned strs (made once by intern_names),
+// the first `required` of which are mandatory; keywords are matched to them
+// by identity, with string equality as the fallback.  `out` receives
 // borrowed references (nullptr for an omitted optional argument).  Raises the
 // interpreter's usual TypeErrors.
 void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames,
-                const char *const *names, int required, int total, PyObject **out);
+                PyObject *const *keys, int required, int total, PyObject **out);
+// The interned strs of `n` parameter names, kept for the life of the process.
+PyObject *const *intern_names(const char *const *names, int n);
 
 // Unpack a 2- or 3-item sequence the way Python's tuple unpacking does
 // (tuples and lists fast, any iterable otherwise).

@@ -181,10 +181,10 @@ void init(Q *q, Borrowed location_data_cache) {
   auto &n = host::names();
   struct {
     Ref *signal;
-    const char *handler;
-  } conns[] = {{&n.now_tree_branch_ready, "_CB_TreeBranchesNowReady"},
-               {&n.inspect_failed, "_CB_InspectFailed"},
-               {&n.cleared, "_CB_LocReadyCleared"}};
+    Borrowed handler;
+  } conns[] = {{&n.now_tree_branch_ready, PY_NAME("_CB_TreeBranchesNowReady")},
+               {&n.inspect_failed, PY_NAME("_CB_InspectFailed")},
+               {&n.cleared, PY_NAME("_CB_LocReadyCleared")}};
   for (auto &c : conns) {
     Ref handler = py::getattr(self, c.handler);
     host::objectmodel::connect_while_alive(location_data_cache, *c.signal, handler, self);
@@ -196,7 +196,7 @@ void init(Q *q, Borrowed location_data_cache) {
   f._fGuiMgr = Ref::none();
   {
     Ref singletons = host::gui::GetSingletons();
-    Ref handler = py::getattr(self, "_CB_SingletonChanged");
+    Ref handler = py::getattr(self, PY_NAME("_CB_SingletonChanged"));
     Ref cb = host::mainloop::NoArgCallback(handler);
     host::objectmodel::connect_while_alive(singletons, n.changed, cb, self);
   }
@@ -545,7 +545,7 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
         Ref removal = py::new_list();
         for (auto &item : to_remove)
           py::list_append(removal, item);
-        static Ref *s_difference_update = new Ref(py::interned("difference_update"));
+        static Ref *s_difference_update = new Ref(PY_NAME("difference_update"));
         py::call_method(item_set, *s_difference_update, removal);
       }
       if (PyObject_Size(item_set.get()) == 0) {

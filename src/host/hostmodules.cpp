@@ -51,4 +51,72 @@ Names &names() {
   return *n;
 }
 
+namespace {
+
+Snapshot *g_snapshot = nullptr;
+
+struct AttrSource {
+  py::Ref Modules::*module;
+  const char *name;
+};
+constexpr AttrSource kSources[] = {{&Modules::scopescanner, "kWaitingForData"},
+                                   {&Modules::scopescanner, "kFinishedScanning"},
+                                   {&Modules::scopescanner, "kScanAbandoned"},
+                                   {&Modules::scopescanner, "CWholeFilePrimaryScanner"},
+                                   {&Modules::scopescanner, "CSingleScopePrimaryScanner"},
+                                   {&Modules::scopescanner, "CWholeFileSecondaryScanner"},
+                                   {&Modules::scopescanner, "CSingleScopeSecondaryScanner"},
+                                   {&Modules::scopescanner, "CScanner"},
+                                   {&Modules::location, "IsAsyncInspectLocation"},
+                                   {&Modules::utils, "IsPythonSource"},
+                                   {&Modules::analysis, "CPySourceAnalysis"}};
+static_assert(sizeof(kSources) / sizeof(kSources[0]) == static_cast<size_t>(Attr::kCount));
+
+PyObject *source_name(int i) {
+  static PyObject **names = [] {
+    auto **n = new PyObject *[static_cast<int>(Attr::kCount)];
+    for (int k = 0; k < static_cast<int>(Attr::kCount); ++k)
+      n[k] = py::intern(kSources[k].name).release();
+    return n;
+  }();
+  return names[i];
+}
+
+} // namespace
+
+py::Ref attr(Attr a) {
+  const int i = static_cast<int>(a);
+  py::Ref *slot = g_snapshot ? &g_snapshot->values_[i] : nullptr;
+  if (slot && *slot)
+    return *slot;
+  py::Ref v = py::module_attr(modules->*kSources[i].module, py::Borrowed(source_name(i)));
+  if (slot)
+    *slot = v;
+  return v;
+}
+
+Snapshot::Snapshot() noexcept {
+  if (!g_snapshot) {
+    g_snapshot = this;
+    active_ = true;
+  }
+}
+
+Snapshot::~Snapshot() {
+  if (active_)
+    g_snapshot = nullptr;
+}
+
+py::Ref Snapshot::floating(double t) {
+  Snapshot *s = g_snapshot;
+  if (s && s->float_obj_ && s->float_value_ == t)
+    return s->float_obj_;
+  py::Ref f = py::floating(t);
+  if (s) {
+    s->float_value_ = t;
+    s->float_obj_ = f;
+  }
+  return f;
+}
+
 } // namespace host

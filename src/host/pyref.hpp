@@ -247,9 +247,13 @@ inline Py_hash_t hash(Borrowed o) {
   return h;
 }
 
+// a == b: identity first; two exact strs compare as text without the rich
+// comparison protocol; anything else through ==.
 inline bool eq(Borrowed a, Borrowed b) {
   if (a.get() == b.get())
     return true;
+  if (PyUnicode_CheckExact(a.get()) && PyUnicode_CheckExact(b.get()))
+    return _PyUnicode_EQ(a.get(), b.get()) != 0;
   int r = PyObject_RichCompareBool(a.get(), b.get(), Py_EQ);
   if (r < 0)
     throw_error();

@@ -93,7 +93,7 @@ bool is_python(C *c, Borrowed loc) {
     if (py::truth(py::call_method(url, *s_endswith, suffixes)))
       return true;
   }
-  Ref is_src = py::call(py::getattr(host::modules->utils, PY_NAME("IsPythonSource")), loc);
+  Ref is_src = py::call(host::attr(host::Attr::IsPythonSource), loc);
   if (py::truth(is_src))
     return true;
   return has(call::GetAnalysis(c, loc, true));
@@ -117,6 +117,8 @@ void report_current_exception(Borrowed exc) {
 
 PyObject *CB_DoIdleAnalysis(C *c) {
   auto &f = c->f;
+  // Host module attributes are read once for the whole slice.
+  host::Snapshot snapshot;
   const double budget = slice_budget();
   log(c, PY_NAME(msgs::kEntering));
   if (f.fQuitting) {
@@ -388,7 +390,7 @@ bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
 Ref GetAnalysis(C *c, Borrowed loc, bool create) {
   Ref ana = py::call_method(c->f.fCacheMgr, PY_NAME("GetAnalysis"), loc,
                             Borrowed(create ? Py_True : Py_False));
-  Ref cls = py::getattr(host::modules->analysis, PY_NAME("CPySourceAnalysis"));
+  Ref cls = host::attr(host::Attr::CPySourceAnalysis);
   int is = PyObject_IsInstance(ana.get(), cls.get());
   if (is < 0)
     py::throw_error();

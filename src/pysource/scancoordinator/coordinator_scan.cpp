@@ -31,14 +31,13 @@ constexpr const char *kFinishSecondary = "Finished secondary whole file scan: %r
 enum class Outcome { Waiting, Unfinished, Finished, Abandoned };
 
 Outcome run_slice(Borrowed scanner, double end_time) {
-  static Ref *s_scan = new Ref(PY_NAME("Scan"));
-  Ref end = py::floating(end_time);
-  Ref st = py::call_method(scanner, *s_scan, end);
-  if (py::eq(st, host::scanners::State(PY_NAME("kWaitingForData"))))
+  Ref end = host::Snapshot::floating(end_time);
+  Ref st = py::call_method(scanner, PY_NAME("Scan"), end);
+  if (py::eq(st, host::attr(host::Attr::kWaitingForData)))
     return Outcome::Waiting;
-  if (py::eq(st, host::scanners::State(PY_NAME("kFinishedScanning"))))
+  if (py::eq(st, host::attr(host::Attr::kFinishedScanning)))
     return Outcome::Finished;
-  if (py::eq(st, host::scanners::State(PY_NAME("kScanAbandoned"))))
+  if (py::eq(st, host::attr(host::Attr::kScanAbandoned)))
     return Outcome::Abandoned;
   return Outcome::Unfinished;
 }
@@ -53,15 +52,13 @@ Ref incomplete_set(C *c, Borrowed loc) {
   return py::check(PyObject_GetItem(c->f._fIncompleteScansByLoc.get(), loc.get()));
 }
 
-Ref new_scanner(Borrowed cls, std::initializer_list<PyObject *> args, Borrowed incomplete,
-                Borrowed log) {
-  Ref type = host::scanners::Class(cls);
-  std::vector<PyObject *> argv(args);
+// cls(a, b, incomplete_scope_set=incomplete, log=log)
+Ref new_scanner(host::Attr cls, Borrowed a, Borrowed b, Borrowed incomplete, Borrowed log) {
+  Ref type = host::attr(cls);
   static Ref *kw = new Ref(
       py::check(PyTuple_Pack(2, PY_NAME("incomplete_scope_set").get(), PY_NAME("log").get())));
-  argv.push_back(incomplete.get());
-  argv.push_back(log.get());
-  return py::call_kw(type, argv.data(), args.size(), *kw);
+  PyObject *argv[] = {a.get(), b.get(), incomplete.get(), log.get()};
+  return py::call_kw(type, argv, 2, *kw);
 }
 
 } // namespace
@@ -75,8 +72,7 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   Ref scanner = py::dict_get(active, loc);
   if (!scanner) {
     Ref incomplete = incomplete_set(c, loc);
-    scanner = new_scanner(PY_NAME("CWholeFilePrimaryScanner"), {loc.get(), scan_name.get()},
-                          incomplete, f.fLog);
+    scanner = new_scanner(host::Attr::CWholeFilePrimaryScanner, loc, scan_name, incomplete, f.fLog);
     py::dict_set(active, loc, scanner);
     log(c, PY_NAME(msgs::kStartWhole), loc);
   }
@@ -140,8 +136,7 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     if (has(ana))
       py::call_method(ana, PY_NAME("UpdateFromCache"));
     Ref incomplete = incomplete_set(c, loc);
-    scanner = new_scanner(PY_NAME("CSingleScopePrimaryScanner"), {loc.get(), scope.get()},
-                          incomplete, f.fLog);
+    scanner = new_scanner(host::Attr::CSingleScopePrimaryScanner, loc, scope, incomplete, f.fLog);
     py::dict_set(active, key, scanner);
     py::call(f.fLog, PY_NAME(msgs::kStartScope), scope, loc);
   }
@@ -204,7 +199,7 @@ bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   Ref loc = item_field(scan_item, 0), scan_name = item_field(scan_item, 2);
   if (!host::infocache::WantDerivedInfo(f._fInfoCache, loc))
     return false;
-  Ref base = host::scanners::Class(PY_NAME("CScanner"));
+  Ref base = host::attr(host::Attr::CScanner);
   auto require_scanner = [&](const Ref &s) {
     int ok = PyObject_IsInstance(s.get(), base.get());
     if (ok < 0)
@@ -219,8 +214,7 @@ bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   if (scanner && !scanner.is_none()) {
     require_scanner(scanner);
   } else {
-    scanner = py::call(host::scanners::Class(PY_NAME("CWholeFileSecondaryScanner")), loc, scan_name,
-                       f.fLog);
+    scanner = py::call(host::attr(host::Attr::CWholeFileSecondaryScanner), loc, scan_name, f.fLog);
     require_scanner(scanner);
     py::dict_set(active, loc, scanner);
     log(c, PY_NAME(msgs::kStartSecondary), loc);
@@ -245,7 +239,7 @@ bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double 
   Ref active = f.fActiveSecondarySingleScopeScanners;
   Ref scanner = py::dict_get(active, key);
   if (!scanner) {
-    scanner = py::call(host::scanners::Class(PY_NAME("CSingleScopeSecondaryScanner")), info, f.fLog,
+    scanner = py::call(host::attr(host::Attr::CSingleScopeSecondaryScanner), info, f.fLog,
                        Borrowed(Py_None), f.fAnaMgr);
     py::dict_set(active, key, scanner);
   }

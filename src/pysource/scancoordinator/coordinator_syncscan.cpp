@@ -200,8 +200,7 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
     static Ref *kw = new Ref(
         py::check(PyTuple_Pack(2, PY_NAME("incomplete_scope_set").get(), PY_NAME("log").get())));
     PyObject *argv[] = {loc.get(), scope_name.get(), incomplete.get(), f.fLog.get()};
-    Ref scanner =
-        py::call_kw(host::scanners::Class(PY_NAME("CSingleScopePrimaryScanner")), argv, 2, *kw);
+    Ref scanner = py::call_kw(host::attr(host::Attr::CSingleScopePrimaryScanner), argv, 2, *kw);
     Ref result;
     try {
       Ref st = py::call_method(scanner, PY_NAME("Scan"), py::floating(end_time));
@@ -209,13 +208,12 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
         sq::RemoveScanTriple(queue(c), loc, scope_name, primary, Borrowed(), true, Borrowed());
         result = state->not_found_result;
       } else {
-        const bool finished =
-            st.get() == host::scanners::State(PY_NAME("kFinishedScanning")).get() ||
-            st.get() == host::scanners::State(PY_NAME("kScanAbandoned")).get();
+        const bool finished = st.get() == host::attr(host::Attr::kFinishedScanning).get() ||
+                              st.get() == host::attr(host::Attr::kScanAbandoned).get();
         if (!finished)
           call::AddPairsToPrimaryQueue(c, one_pair_list(loc, scope_name), Borrowed(Py_True),
                                        Borrowed(Py_None));
-        if (st.get() == host::scanners::State(PY_NAME("kWaitingForData")).get()) {
+        if (st.get() == host::attr(host::Attr::kWaitingForData).get()) {
           result = state->waiting_result;
         } else {
           py::call_method(scanner, PY_NAME("SaveToInfoCache"));

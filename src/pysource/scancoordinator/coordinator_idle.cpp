@@ -218,7 +218,7 @@ void DoScans(C *c, double end_time) {
           py::throw_error();
         if (recent) {
           log(c, PY_NAME(msgs::kTooRecent), tuple_of(loc, scope, scan_name));
-          sq::ScanCompleted(q, item);
+          sq::ScanCompleted(q, item, key);
           return;
         }
       }
@@ -230,7 +230,7 @@ void DoScans(C *c, double end_time) {
       f.fActiveLoc = loc;
       if (call::DoSingleScan(c, item, end_time))
         return;
-      sq::ScanCompleted(q, item);
+      sq::ScanCompleted(q, item, key);
       py::call_method(f._fInfoCache, PY_NAME("Trim"));
       Ref per_loc = py::dict_get(f._fLastScanCompleted, loc);
       if (!per_loc) {
@@ -299,9 +299,7 @@ bool CheckWholeFiles(C *c, double end_time) {
         if (!has_primary)
           continue;
         py::list_append(up_to_date, loc);
-        Ref one = py::check(PyList_New(1));
-        PyList_SET_ITEM(one.get(), 0, Ref(loc).release());
-        sq::RemoveAllForLocations(q, one, Borrowed(), true);
+        sq::RemoveAllForLocation(q, loc, Borrowed(), true);
         Ref derived = host::anamgr::DerivedScanName(f.fAnaMgr);
         int has_derived = PySequence_Contains(done.get(), derived.get());
         if (has_derived < 0)

@@ -145,6 +145,7 @@ void exec_body(py::Borrowed module) {
   st->debug = py::as_ll(py::getattr(sys_flags, PY_NAME("optimize"))) == 0;
   st->defaultdict = py::getattr(m->collections, PY_NAME("defaultdict"));
   st->int_type = py::Ref::borrow(reinterpret_cast<PyObject *>(&PyLong_Type));
+  st->one = py::integer(1);
   st->kWildcardScope = py::getattr(m->symbolinfo, PY_NAME("kWildcardScope"));
   st->not_found_result = py::check(Py_BuildValue("(OOO)", Py_False, Py_None, Py_None));
   st->waiting_result = py::check(Py_BuildValue("(OOO)", Py_True, Py_None, Py_None));

@@ -27,6 +27,7 @@ struct State {
   py::Ref kWildcardScope;   // symbolinfo.kWildcardScope ('*')
   py::Ref empty_item;       // CScanItem(None, None, None, None)
   py::Ref priorities[3];    // the three published priority ints
+  py::Ref one;              // the int 1, a count's first value and step
   py::Ref not_found_result; // (False, None, None), shared
   py::Ref waiting_result;   // (True, None, None), shared
   PyTypeObject *SingleQueueType = nullptr;

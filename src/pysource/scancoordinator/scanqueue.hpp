@@ -45,7 +45,9 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
 // call.  It may hold every pair of a large batch, so it avoids one large
 // transient buffer that the C allocator would keep resident afterwards:
 //  - as a view, it refers to the caller's tuple of pairs and records which of
-//    them are taken as runs of indices (usually a single run);
+//    them are taken as runs of indices (usually a single run, kept inline);
+//  - as a single pair, it holds that pair inline (the coordinator queues one
+//    pair after each scan);
 //  - otherwise it owns the pairs, in small blocks from Python's allocator.
 struct PairRef {
   Borrowed first, second;
@@ -66,11 +68,13 @@ public:
   PairList() = default;
   // A view over `pairs`, a tuple whose items are 2-tuples.
   explicit PairList(Ref pairs) : view_(std::move(pairs)) {}
+  // The one pair (a, b).
+  PairList(Borrowed a, Borrowed b) : one_{a.ref(), b.ref()}, size_(1) {}
   PairList(const PairList &) = delete;
   PairList &operator=(const PairList &) = delete;
   PairList(PairList &&o) noexcept
-      : view_(std::move(o.view_)), runs_(std::move(o.runs_)), head_(o.head_), tail_(o.tail_),
-        size_(o.size_) {
+      : view_(std::move(o.view_)), run_(o.run_), more_runs_(std::move(o.more_runs_)),
+        one_(std::move(o.one_)), head_(o.head_), tail_(o.tail_), size_(o.size_) {
     o.head_ = o.tail_ = nullptr;
     o.size_ = 0;
   }
@@ -101,10 +105,14 @@ public:
   }
   // View mode: take the pair at index i (indices ascending).
   void take(Py_ssize_t i) {
-    if (!runs_.empty() && runs_.back().end == i)
-      ++runs_.back().end;
+    if (size_ == 0)
+      run_ = Run{i, i + 1};
+    else if (more_runs_.empty() && run_.end == i)
+      ++run_.end;
+    else if (!more_runs_.empty() && more_runs_.back().end == i)
+      ++more_runs_.back().end;
     else
-      runs_.push_back(Run{i, i + 1});
+      more_runs_.push_back(Run{i, i + 1});
     ++size_;
   }
   size_t size() const { return size_; }
@@ -113,11 +121,21 @@ public:
   // Calls f(PairRef) for every pair, in order.
   template <typename F> void for_each(F &&f) const {
     if (view_) {
-      for (const Run &r : runs_)
+      if (size_ == 0)
+        return;
+      auto walk = [&](const Run &r) {
         for (Py_ssize_t i = r.begin; i < r.end; ++i) {
           PyObject *pair = PyTuple_GET_ITEM(view_.get(), i);
           f(PairRef{Borrowed(PyTuple_GET_ITEM(pair, 0)), Borrowed(PyTuple_GET_ITEM(pair, 1))});
         }
+      };
+      walk(run_);
+      for (const Run &r : more_runs_)
+        walk(r);
+      return;
+    }
+    if (one_.first) {
+      f(PairRef{Borrowed(one_.first), Borrowed(one_.second)});
       return;
     }
     for (const Block *b = head_; b; b = b->next)
@@ -127,11 +145,16 @@ public:
 
 private:
   Ref view_;
-  std::vector<Run> runs_;
+  Run run_{0, 0};
+  std::vector<Run> more_runs_;
+  std::pair<Ref, Ref> one_;
   Block *head_ = nullptr;
   Block *tail_ = nullptr;
   size_t size_ = 0;
 };
+// AddScanPairs([(loc, scope)], ...) without the one-pair sequence.
+void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                 bool add_to_check);
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
@@ -141,8 +164,11 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
                       bool remove_waiting, Borrowed key);
 void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting);
+// RemoveAllForLocations([loc], ...), without the one-item sequence.
+void RemoveAllForLocation(Q *q, Borrowed loc, Borrowed scan_name_set, bool remove_waiting);
 void Clear(Q *q);
-void ScanCompleted(Q *q, Borrowed scan_item);
+// `key` is the scan's (scope, scan name) tuple when the caller has it.
+void ScanCompleted(Q *q, Borrowed scan_item, Borrowed key = Borrowed());
 void destroy_impl(Q *q);
 
 // ---- retrieval and queries -----------------------------------------------
@@ -182,6 +208,9 @@ void SignalEmitIdle(Q *q);
 namespace call {
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check);
+// AddScanPairs([(loc, scope)], ...) without the one-pair sequence.
+void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                 bool add_to_check);
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,

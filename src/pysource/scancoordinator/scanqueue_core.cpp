@@ -44,12 +44,36 @@ PyObject *require_dict(const Ref &o) {
 
 bool is_wildcard(Borrowed scope) { return py::eq(scope, state->kWildcardScope); }
 
-// (scan count, location count) stored in _fPerScanNameCounts.
+// (scan count, location count) stored in _fPerScanNameCounts: read straight
+// from the tuple when it is the pair of ints the queue stores.
 void read_count_pair(Borrowed pair, long long &scans, long long &locs) {
+  PyObject *p = pair.get();
+  if (PyTuple_CheckExact(p) && PyTuple_GET_SIZE(p) == 2 &&
+      PyLong_CheckExact(PyTuple_GET_ITEM(p, 0)) && PyLong_CheckExact(PyTuple_GET_ITEM(p, 1))) {
+    scans = py::as_ll(Borrowed(PyTuple_GET_ITEM(p, 0)));
+    locs = py::as_ll(Borrowed(PyTuple_GET_ITEM(p, 1)));
+    return;
+  }
   Ref parts[2];
   unpack(pair, 2, parts);
   scans = py::as_ll(parts[0]);
   locs = py::as_ll(parts[1]);
+}
+
+// Lookups in a dictionary with the key's hash computed once by the caller:
+// a (scope, scan name) key is looked up and then stored or deleted, and
+// hashing the tuple is most of a lookup's cost.
+Ref get_kh(Borrowed d, Borrowed key, Py_hash_t hash) {
+  PyObject *v = _PyDict_GetItem_KnownHash(d.get(), key.get(), hash);
+  if (!v) {
+    if (PyErr_Occurred())
+      py::throw_error();
+    return Ref();
+  }
+  return Ref::borrow(v);
+}
+void del_kh(Borrowed d, Borrowed key, Py_hash_t hash) {
+  py::check_int(_PyDict_DelItem_KnownHash(d.get(), key.get(), hash));
 }
 
 Ref make_count_pair(long long scans, long long locs) {
@@ -64,7 +88,17 @@ Ref make_count_pair(long long scans, long long locs) {
 // dictionary.  Untracked, the (counts, pending) pair stays untracked too, so
 // the queue's per-location records cost the cyclic GC nothing.
 Ref new_counts_dict() {
-  Ref d = py::call(state->defaultdict, state->int_type);
+  // defaultdict(int), made by its type's own new and init with a prepared
+  // argument tuple rather than through a call that packs one each time.
+  auto *type = reinterpret_cast<PyTypeObject *>(state->defaultdict.get());
+  static Ref *args = new Ref(py::check(PyTuple_Pack(1, state->int_type.get())));
+  Ref d;
+  if (type->tp_new && type->tp_init) {
+    d = py::check(type->tp_new(type, args->get(), nullptr));
+    py::check_int(type->tp_init(d.get(), args->get(), nullptr));
+  } else {
+    d = py::call(state->defaultdict, state->int_type);
+  }
   if (PyObject_GC_IsTracked(d.get()) && PyDict_GET_SIZE(d.get()) == 0)
     PyObject_GC_UnTrack(d.get());
   return d;
@@ -282,24 +316,29 @@ Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bor
 
 namespace {
 void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority, Borrowed k,
-                             LocInfo &info);
+                             Py_hash_t k_hash, LocInfo &info);
 } // namespace
 
 namespace {
 // One pair of AddScanPairs: ready pairs are taken, the others parked.
 // Returns whether the pair's location is ready.
+bool ready_or_parked(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed prio,
+                     bool add_to_check) {
+  if (!q->f.fAnyAsyncInspectLocation && host::locations::IsAsyncInspectLocation(loc))
+    q->f.fAnyAsyncInspectLocation = true;
+  if (call::IsTreeBranchReady(q, loc))
+    return true;
+  Ref item = make_scan_item(loc, scope, scan_name, prio);
+  Ref items = py::check(PyTuple_Pack(1, item.get()));
+  AddItemsWaitingForInspect(q, loc, items);
+  if (add_to_check)
+    SetWholeFileCheckWaitingForInspect(q, loc, prio);
+  return false;
+}
+
 bool sort_pair(Q *q, Borrowed pair, Borrowed scan_name, Borrowed prio, bool add_to_check, Ref *lp) {
   unpack_tuple(pair, 2, lp);
-  if (!q->f.fAnyAsyncInspectLocation && host::locations::IsAsyncInspectLocation(lp[0]))
-    q->f.fAnyAsyncInspectLocation = true;
-  if (call::IsTreeBranchReady(q, lp[0]))
-    return true;
-  Ref item = make_scan_item(lp[0], lp[1], scan_name, prio);
-  Ref items = py::check(PyTuple_Pack(1, item.get()));
-  AddItemsWaitingForInspect(q, lp[0], items);
-  if (add_to_check)
-    SetWholeFileCheckWaitingForInspect(q, lp[0], prio);
-  return false;
+  return ready_or_parked(q, lp[0], lp[1], scan_name, prio, add_to_check);
 }
 } // namespace
 
@@ -349,6 +388,15 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
   call::AddReadyScanPairs(q, ready, scan_name, prio, add_to_check);
 }
 
+void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                 bool add_to_check) {
+  Ref prio = priority && !priority.is_none() ? priority.ref() : state->priorities[2];
+  if (!ready_or_parked(q, loc, scope, scan_name, prio, add_to_check))
+    return;
+  const PairList one(loc, scope);
+  call::AddReadyScanPairs(q, one, scan_name, prio, add_to_check);
+}
+
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check) {
   const long long p = as_int64(priority);
@@ -356,7 +404,8 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
   Ref sq_obj = call::GetSingleQueue(q, scan_name, p);
   SingleQueueObject *sq = as_single_queue(sq_obj.get());
   Ref uod = sq->f.fOrderedDict;
-  Ref wild_key; // ('*', scan_name), built on first use
+  Ref wild_key; // ('*', scan_name) and its hash, made on first use
+  Py_hash_t wild_hash = -1;
   Ref visible = q->f._fVisibleDocLocs;
   Ref whole_files = q->f._fWholeFilesToCheck;
   const Borrowed wildcard = state->kWildcardScope;
@@ -365,8 +414,15 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     Borrowed loc = lp.first, scope = lp.second;
     Ref key = make_key(scope, scan_name);
     LocInfo info = loc_info(q, loc);
-    // 1. already queued?
-    Ref existing = info ? py::dict_get(info.pending, key) : find_waiting_priority(q, loc);
+    // 1. already queued?  (The key's hash serves this lookup and the store.)
+    Py_hash_t key_hash = -1;
+    Ref existing;
+    if (info) {
+      key_hash = py::hash(key);
+      existing = get_kh(info.pending, key, key_hash);
+    } else {
+      existing = find_waiting_priority(q, loc);
+    }
     if (existing) {
       if (as_int64(existing) > p) {
         call::RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
@@ -378,9 +434,11 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     // 2. the whole file already queued at the same or a better priority?
     const bool scope_is_wild = is_wildcard(scope);
     if (!scope_is_wild) {
-      if (!wild_key)
+      if (!wild_key) {
         wild_key = make_key(wildcard, scan_name);
-      Ref whole = info ? py::dict_get(info.pending, wild_key) : find_waiting_priority(q, loc);
+        wild_hash = py::hash(wild_key);
+      }
+      Ref whole = info ? get_kh(info.pending, wild_key, wild_hash) : find_waiting_priority(q, loc);
       if (whole && as_int64(whole) <= p)
         return;
     }
@@ -420,7 +478,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
       }
     }
     // 8. bookkeeping; 9. the whole-file check
-    add_to_per_location_map(q, loc, scan_name, prio, key, info);
+    add_to_per_location_map(q, loc, scan_name, prio, key, key_hash, info);
     if (add_to_check)
       py::dict_set(whole_files, loc, prio);
   });
@@ -428,9 +486,10 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
 
 namespace {
 // _AddScanToPerLocationMap with the location's entry already looked up
-// (empty when it has none).
+// (empty when it has none); `k_hash` is the key's hash, or -1 when the
+// caller has not computed it.
 void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority, Borrowed k,
-                             LocInfo &info) {
+                             Py_hash_t k_hash, LocInfo &info) {
   if (!info) {
     info.counts = new_counts_dict();
     info.pending = py::new_dict();
@@ -447,7 +506,9 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
     if (stored != priority.get())
       assertion_failed();
   } else {
-    py::dict_set(info.pending, k, priority);
+    if (k_hash == -1)
+      k_hash = py::hash(k);
+    py::check_int(_PyDict_SetItem_KnownHash(info.pending.get(), k.get(), priority.get(), k_hash));
   }
 
   Ref old = py::dict_get(info.counts, scan_name);
@@ -471,21 +532,23 @@ void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_n
                              Borrowed priority, Borrowed key) {
   LocInfo info = loc_info(q, loc);
   Ref k = key ? key.ref() : make_key(scope, scan_name);
-  add_to_per_location_map(q, loc, scan_name, priority, k, info);
+  add_to_per_location_map(q, loc, scan_name, priority, k, -1, info);
 }
 
 // ---- removing ------------------------------------------------------------
 
-bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
-                                  Borrowed priority, Borrowed key) {
-  LocInfo info = loc_info(q, loc);
-  if (!info)
-    return false;
-  Ref k = key ? key.ref() : make_key(scope, scan_name);
-  Ref recorded = py::dict_get(info.pending, k);
+namespace {
+// _RemoveScanFromPerLocationMap with the location's entry looked up and the
+// key built: the key is hashed once for its lookup and its removal, and
+// whether the scan name is still counted for the location is known from the
+// count just updated rather than asked of the dictionary again.
+bool remove_from_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed priority,
+                                  Borrowed k, const LocInfo &info) {
+  const Py_hash_t h = py::hash(k);
+  Ref recorded = get_kh(info.pending, k, h);
   if (!recorded || !py::eq(recorded, priority))
     return false;
-  py::dict_del(info.pending, k);
+  del_kh(info.pending, k, h);
   if (PyDict_GET_SIZE(info.pending.get()) == 0) {
     py::dict_del(q->f._fPerLocationInfo, loc);
     call::LocationRemoved(q, loc);
@@ -506,7 +569,7 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   long long scans = 0, locs = 0;
   read_count_pair(pair, scans, locs);
   scans -= 1;
-  if (!py::dict_contains(info.counts, scan_name))
+  if (per_loc == 0)
     locs -= 1;
   if (scans == 0) {
     if (state->debug && locs != 0)
@@ -518,6 +581,16 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
     store_count_pair(q, scan_name, pair, scans, locs);
   }
   return true;
+}
+} // namespace
+
+bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
+                                  Borrowed priority, Borrowed key) {
+  LocInfo info = loc_info(q, loc);
+  if (!info)
+    return false;
+  Ref k = key ? key.ref() : make_key(scope, scan_name);
+  return remove_from_per_location_map(q, loc, scan_name, priority, k, info);
 }
 
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
@@ -583,42 +656,54 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   return false;
 }
 
-void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting) {
+void RemoveAllForLocation(Q *q, Borrowed loc_b, Borrowed scan_name_set, bool remove_waiting) {
   const bool all_names = !scan_name_set || scan_name_set.is_none();
-  py::for_each(loc_seq, [&](Borrowed loc_b) {
-    Ref loc = loc_b.ref();
-    bool kept = false;
-    LocInfo info = loc_info(q, loc);
-    if (info) {
-      // Snapshot: RemoveScanTriple deletes from the pending dictionary.
-      std::vector<std::pair<Ref, Ref>> snapshot;
-      snapshot.reserve(static_cast<size_t>(PyDict_GET_SIZE(info.pending.get())));
-      Py_ssize_t pos = 0;
-      PyObject *k, *v;
-      while (PyDict_Next(info.pending.get(), &pos, &k, &v))
-        snapshot.emplace_back(Ref::borrow(k), Ref::borrow(v));
-      for (auto &kv : snapshot) {
-        Ref parts[2];
-        unpack(kv.first, 2, parts);
-        bool take = all_names;
-        if (!take) {
-          int r = PySequence_Contains(scan_name_set.get(), parts[1].get());
-          if (r < 0)
-            py::throw_error();
-          take = r != 0;
-        }
-        if (take)
-          call::RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first);
-        else
-          kept = true;
+  Ref loc = loc_b.ref();
+  bool kept = false;
+  LocInfo info = loc_info(q, loc);
+  if (info) {
+    // Snapshot: RemoveScanTriple deletes from the pending dictionary.  A
+    // location rarely has more than a few pending scans: they are copied to
+    // the stack, a longer dictionary to the heap.
+    constexpr Py_ssize_t kLocal = 4;
+    std::pair<Ref, Ref> local[kLocal];
+    std::vector<std::pair<Ref, Ref>> heap;
+    const Py_ssize_t n = PyDict_GET_SIZE(info.pending.get());
+    std::pair<Ref, Ref> *snapshot = local;
+    if (n > kLocal) {
+      heap.resize(static_cast<size_t>(n));
+      snapshot = heap.data();
+    }
+    Py_ssize_t pos = 0, count = 0;
+    PyObject *k, *v;
+    while (count < n && PyDict_Next(info.pending.get(), &pos, &k, &v))
+      snapshot[count++] = {Ref::borrow(k), Ref::borrow(v)};
+    for (Py_ssize_t i = 0; i < count; ++i) {
+      const auto &kv = snapshot[i];
+      Ref parts[2];
+      unpack(kv.first, 2, parts);
+      bool take = all_names;
+      if (!take) {
+        int r = PySequence_Contains(scan_name_set.get(), parts[1].get());
+        if (r < 0)
+          py::throw_error();
+        take = r != 0;
       }
+      if (take)
+        call::RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first);
+      else
+        kept = true;
     }
-    if (remove_waiting && !kept && PyDict_GET_SIZE(q->f._fWaitingForInspectByLoc.get()) != 0) {
-      Ref waiting = q->f._fWaitingForInspectByLoc;
-      if (py::dict_contains(waiting, loc))
-        py::dict_del(waiting, loc);
-    }
-  });
+  }
+  if (remove_waiting && !kept && PyDict_GET_SIZE(q->f._fWaitingForInspectByLoc.get()) != 0) {
+    Ref waiting = q->f._fWaitingForInspectByLoc;
+    Ref dropped = py::check(_PyDict_Pop(waiting.get(), loc.get(), Py_None));
+  }
+}
+
+void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting) {
+  py::for_each(loc_seq,
+               [&](Borrowed loc) { RemoveAllForLocation(q, loc, scan_name_set, remove_waiting); });
 }
 
 void Clear(Q *q) {
@@ -638,16 +723,17 @@ void Clear(Q *q) {
   f.fAnyAsyncInspectLocation = false;
 }
 
-void ScanCompleted(Q *q, Borrowed scan_item) {
+void ScanCompleted(Q *q, Borrowed scan_item, Borrowed key) {
   Ref loc = item_field(scan_item, 0), scope = item_field(scan_item, 1),
       scan_name = item_field(scan_item, 2), priority = item_field(scan_item, 3);
-  Ref key = make_scan_item(loc, scope, scan_name, Borrowed(Py_None));
+  Ref done = make_scan_item(loc, scope, scan_name, Borrowed(Py_None));
+  // Hashing the four-field record once serves the lookup and the store.
   Ref counts = q->f._fCompletedCount;
-  Ref old = py::dict_get(counts, key);
-  Ref one = py::integer(1);
-  Ref now = old ? py::check(PyNumber_Add(old.get(), one.get())) : one;
-  py::dict_set(counts, key, now);
-  call::RemoveScanTriple(q, loc, scope, scan_name, priority, true, Borrowed());
+  const Py_hash_t h = py::hash(done);
+  Ref old = get_kh(counts, done, h);
+  Ref now = old ? py::check(PyNumber_Add(old.get(), state->one.get())) : state->one;
+  py::check_int(_PyDict_SetItem_KnownHash(counts.get(), done.get(), now.get(), h));
+  call::RemoveScanTriple(q, loc, scope, scan_name, priority, true, key);
 }
 
 void destroy_impl(Q *q) {

@@ -44,8 +44,7 @@ void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_prior
     if (!check)
       check = Ref::none();
   }
-  Ref one = py::check(PyTuple_Pack(1, loc.get()));
-  RemoveAllForLocations(q, one, Borrowed(), false);
+  RemoveAllForLocation(q, loc, Borrowed(), false);
   AddItemsWaitingForInspect(q, loc, items);
   SetWholeFileCheckWaitingForInspect(q, loc, check);
 }

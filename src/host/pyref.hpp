@@ -303,8 +303,28 @@ inline bool set_discard(Borrowed s, Borrowed key) {
 inline void list_append(Borrowed l, Borrowed v) { check_int(PyList_Append(l.get(), v.get())); }
 
 // Iterate any iterable: for_each(obj, [&](Borrowed item){...}).
-// for_each_while stops early when f returns false.
+// for_each_while stops early when f returns false.  Exact tuples and lists
+// are walked by index, without an iterator object.
 template <typename F> void for_each_while(Borrowed iterable, F &&f) {
+  PyObject *o = iterable.get();
+  if (PyTuple_CheckExact(o)) {
+    Ref keep = iterable.ref();
+    for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(o); ++i)
+      if (!f(Borrowed(PyTuple_GET_ITEM(o, i))))
+        return;
+    return;
+  }
+  if (PyList_CheckExact(o)) {
+    // As a list iterator walks it: by index, the length read at every step,
+    // each item held while f runs.
+    Ref keep = iterable.ref();
+    for (Py_ssize_t i = 0; i < PyList_GET_SIZE(o); ++i) {
+      Ref item = Ref::borrow(PyList_GET_ITEM(o, i));
+      if (!f(item.borrowed()))
+        return;
+    }
+    return;
+  }
   Ref it = check(PyObject_GetIter(iterable.get()));
   for (;;) {
     Ref item = Ref::steal(PyIter_Next(it.get()));

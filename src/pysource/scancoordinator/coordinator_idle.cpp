@@ -212,10 +212,17 @@ void DoScans(C *c, double end_time) {
       Ref t = PyDict_Check(last.get()) ? py::dict_get(last, key)
                                        : py::call_method(last, host::names().get, key);
       if (has(t)) {
-        Ref threshold = py::floating(now - kMinRescanInterval);
-        int recent = PyObject_RichCompareBool(t.get(), threshold.get(), Py_GT);
-        if (recent < 0)
-          py::throw_error();
+        // Times recorded here are floats: compared as doubles, anything else
+        // through the rich comparison.
+        int recent;
+        if (PyFloat_CheckExact(t.get())) {
+          recent = PyFloat_AS_DOUBLE(t.get()) > now - kMinRescanInterval;
+        } else {
+          Ref threshold = py::floating(now - kMinRescanInterval);
+          recent = PyObject_RichCompareBool(t.get(), threshold.get(), Py_GT);
+          if (recent < 0)
+            py::throw_error();
+        }
         if (recent) {
           log(c, PY_NAME(msgs::kTooRecent), tuple_of(loc, scope, scan_name));
           sq::ScanCompleted(q, item, key);
@@ -237,7 +244,11 @@ void DoScans(C *c, double end_time) {
         per_loc = py::new_dict();
         py::dict_set(f._fLastScanCompleted, loc, per_loc);
       }
-      py::check_int(PyObject_SetItem(per_loc.get(), key.get(), py::floating(now).get()));
+      Ref when = py::floating(now);
+      if (PyDict_CheckExact(per_loc.get()))
+        py::dict_set(per_loc, key, when);
+      else
+        py::check_int(PyObject_SetItem(per_loc.get(), key.get(), when.get()));
       f.fActiveLoc = Ref::none();
       if (py::eq(scan_name, host::anamgr::DerivedScanName(f.fAnaMgr)))
         py::set_add(f.fCompletedLocs, loc);
@@ -377,11 +388,16 @@ bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
   if (result)
     return true;
   py::call_method(f._fInfoCache, PY_NAME("FinishedWithScans"), loc, scope, scan_name);
+  // _fScanTripleCompletedCount[(loc, scope, scan name)] += 1, the triple
+  // hashed once for the lookup and the store.
   Ref key = tuple_of(loc, scope, scan_name);
   Ref counts = f._fScanTripleCompletedCount;
-  Ref old = py::dict_get(counts, key);
-  Ref one = py::integer(1);
-  py::dict_set(counts, key, old ? py::check(PyNumber_Add(old.get(), one.get())) : one);
+  const Py_hash_t h = py::hash(key);
+  Ref old = Ref::borrow(_PyDict_GetItem_KnownHash(counts.get(), key.get(), h));
+  if (!old && PyErr_Occurred())
+    py::throw_error();
+  Ref now = old ? py::check(PyNumber_Add(old.get(), state->one.get())) : state->one;
+  py::check_int(_PyDict_SetItem_KnownHash(counts.get(), key.get(), now.get(), h));
   return false;
 }
 

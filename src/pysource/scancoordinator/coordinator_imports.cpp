@@ -84,6 +84,11 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   if (!f._fAnalyzeFoundImports)
     return;
   Ref factory = host::anamgr::AnalysisFactory(f.fAnaMgr);
+  // An empty list or tuple (a scanned file that imports nothing) yields no
+  // names: nothing of the symbol-information module is needed.
+  if ((PyList_CheckExact(imported_equivs.get()) || PyTuple_CheckExact(imported_equivs.get())) &&
+      PySequence_Fast_GET_SIZE(imported_equivs.get()) == 0)
+    return;
   Ref names = py::new_set();
   Borrowed si = host::modules->symbolinfo;
   const Py_ssize_t prefix_len = py::as_ll(py::getattr(si, PY_NAME("kPrefixLen")));

@@ -76,6 +76,15 @@ void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed pri
   call::ScheduleIdle(c);
 }
 
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first,
+                             Borrowed priority) {
+  if (!host::infocache::WantDerivedInfo(c->f._fInfoCache, loc))
+    return;
+  Ref prio = resolve_priority(c, first, priority);
+  sq::AddScanPair(queue(c), loc, scope, host::anamgr::DerivedScanName(c->f.fAnaMgr), prio, false);
+  call::ScheduleIdle(c);
+}
+
 void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
   Ref primary = py::new_list(), secondary = py::new_list();
   py::for_each(needs_scan_set, [&](Borrowed triple) {

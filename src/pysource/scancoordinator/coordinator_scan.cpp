@@ -42,14 +42,31 @@ Outcome run_slice(Borrowed scanner, double end_time) {
   return Outcome::Unfinished;
 }
 
+// d.pop(key, None): one lookup.
 void dict_discard(Borrowed d, Borrowed key) {
-  if (py::dict_contains(d, key))
-    py::dict_del(d, key);
+  Ref dropped = py::check(_PyDict_Pop(d.get(), key.get(), Py_None));
 }
 
 // self._fIncompleteScansByLoc[loc]: the location's set, created when missing.
+// The field is a defaultdict(set); while it still is exactly that, a missing
+// set is made and stored here, as its __missing__ would.
 Ref incomplete_set(C *c, Borrowed loc) {
-  return py::check(PyObject_GetItem(c->f._fIncompleteScansByLoc.get(), loc.get()));
+  Borrowed d = c->f._fIncompleteScansByLoc;
+  if (Py_TYPE(d.get()) == reinterpret_cast<PyTypeObject *>(state->defaultdict.get())) {
+    const Py_hash_t h = py::hash(loc);
+    PyObject *v = _PyDict_GetItem_KnownHash(d.get(), loc.get(), h);
+    if (v)
+      return Ref::borrow(v);
+    if (PyErr_Occurred())
+      py::throw_error();
+    Ref factory = py::getattr(d, PY_NAME("default_factory"));
+    if (factory.get() == reinterpret_cast<PyObject *>(&PySet_Type)) {
+      Ref s = py::new_set();
+      py::check_int(_PyDict_SetItem_KnownHash(d.get(), loc.get(), s.get(), h));
+      return s;
+    }
+  }
+  return py::check(PyObject_GetItem(d.get(), loc.get()));
 }
 
 // cls(a, b, incomplete_scope_set=incomplete, log=log)
@@ -90,10 +107,13 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
     return false;
 
   Ref incomplete = py::dict_get(f._fIncompleteScansByLoc, loc);
-  if (incomplete && PyObject_Size(incomplete.get()) == 0)
-    dict_discard(f._fIncompleteScansByLoc, loc);
-  if (PyErr_Occurred())
-    py::throw_error();
+  if (incomplete) {
+    const Py_ssize_t n = PyObject_Size(incomplete.get());
+    if (n < 0)
+      py::throw_error();
+    if (n == 0)
+      dict_discard(f._fIncompleteScansByLoc, loc);
+  }
 
   Ref locs = py::check(PyList_New(1));
   PyList_SET_ITEM(locs.get(), 0, Ref(loc).release());
@@ -114,8 +134,7 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
     });
     call::AddPairsToPrimaryQueue(c, pairs, Borrowed(Py_True), priority);
   }
-  call::AddPairsToSecondaryQueue(c, one_pair_list(loc, state->kWildcardScope), Borrowed(Py_True),
-                                 priority);
+  call::AddPairToSecondaryQueue(c, loc, state->kWildcardScope, Borrowed(Py_True), priority);
   return false;
 }
 
@@ -173,8 +192,7 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     Ref dirloc = py::call_method(loc, PY_NAME("GetParentDir"));
     call::AddImportEquivsToQueue(c, imported, dirloc, priority);
   }
-  call::AddPairsToSecondaryQueue(c, one_pair_list(loc, scope), Borrowed(Py_False),
-                                 Borrowed(Py_None));
+  call::AddPairToSecondaryQueue(c, loc, scope, Borrowed(Py_False), Borrowed(Py_None));
   Ref scope_def = py::getattr(scanner, PY_NAME("fScopeDef"));
   if (!scope_def.is_none()) {
     Ref inst = Ref::none();

@@ -119,8 +119,7 @@ bool TryToScanDictNow(C *c, Borrowed, Borrowed, Borrowed needs_scan_set, double 
     if (py::eq(parts[2], primary))
       primary_list.push_back(triple);
     else if (!py::set_contains(pending, triple))
-      call::AddPairsToSecondaryQueue(c, one_pair_list(parts[0], parts[1]), Borrowed(Py_True),
-                                     Borrowed(Py_None));
+      call::AddPairToSecondaryQueue(c, parts[0], parts[1], Borrowed(Py_True), Borrowed(Py_None));
   });
   if (primary_list.empty())
     return false;

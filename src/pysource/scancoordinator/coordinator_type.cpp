@@ -450,6 +450,16 @@ void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed pri
   PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
   py::call_kw(ov, argv, 2, *kw);
 }
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first,
+                             Borrowed priority) {
+  py::Ref ov;
+  if (own(c, PY_NAME("AddPairsToSecondaryQueue"), m_AddPairsToSecondaryQueue, ov))
+    return co::AddPairToSecondaryQueue(c, loc, scope, first, priority);
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, PY_NAME("priority").get())));
+  py::Ref pairs = one_pair_list(loc, scope);
+  PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
+  py::call_kw(ov, argv, 2, *kw);
+}
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name) {
   py::Ref ov;
   if (own(c, PY_NAME("_CanSendToHelperProcess"), m__CanSendToHelperProcess, ov))

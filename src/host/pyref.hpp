@@ -285,6 +285,11 @@ inline bool dict_contains(Borrowed d, Borrowed key) {
   return r != 0;
 }
 inline void dict_del(Borrowed d, Borrowed key) { check_int(PyDict_DelItem(d.get(), key.get())); }
+// The dictionary's version tag: it changes whenever the dictionary changes,
+// so a value looked up earlier is still current while the tag is the same.
+inline uint64_t dict_version(Borrowed d) {
+  return reinterpret_cast<PyDictObject *>(d.get())->ma_version_tag;
+}
 
 inline bool set_contains(Borrowed s, Borrowed key) {
   int r = PySet_Contains(s.get(), key.get());

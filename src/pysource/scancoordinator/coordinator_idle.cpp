@@ -200,14 +200,22 @@ void DoScans(C *c, double end_time) {
     }
     Ref item = sq::First(q);
     Ref fields[4];
-    unpack(item, 4, fields);
+    if (PyTuple_Check(item.get()) && PyTuple_GET_SIZE(item.get()) == 4) {
+      // The queue's own CScanItem (a tuple subclass): its four fields.
+      for (int i = 0; i < 4; ++i)
+        fields[i] = Ref::borrow(PyTuple_GET_ITEM(item.get(), i));
+    } else {
+      unpack(item, 4, fields);
+    }
     const Ref &loc = fields[0], &scope = fields[1], &scan_name = fields[2], &priority = fields[3];
     if (loc.is_none()) {
       log(c, PY_NAME(msgs::kLocIsNone));
       return;
     }
     Ref key = sq::make_key(scope, scan_name);
-    Ref last = py::dict_get(f._fLastScanCompleted, loc);
+    Ref times = f._fLastScanCompleted;
+    Ref last = py::dict_get(times, loc);
+    const uint64_t times_version = py::dict_version(times);
     if (has(last)) {
       Ref t = PyDict_Check(last.get()) ? py::dict_get(last, key)
                                        : py::call_method(last, host::names().get, key);
@@ -239,10 +247,12 @@ void DoScans(C *c, double end_time) {
         return;
       sq::ScanCompleted(q, item, key);
       py::call_method(f._fInfoCache, PY_NAME("Trim"));
-      Ref per_loc = py::dict_get(f._fLastScanCompleted, loc);
+      // The entry looked up before the scan is still the one stored unless
+      // the table changed meanwhile.
+      Ref per_loc = py::dict_version(times) == times_version ? last : py::dict_get(times, loc);
       if (!per_loc) {
         per_loc = py::new_dict();
-        py::dict_set(f._fLastScanCompleted, loc, per_loc);
+        py::dict_set(times, loc, per_loc);
       }
       Ref when = py::floating(now);
       if (PyDict_CheckExact(per_loc.get()))

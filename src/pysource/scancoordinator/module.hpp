@@ -66,6 +66,29 @@ inline py::Ref untrack_if_atomic(py::Ref t) {
 // index (its fields are positional), anything else by attribute name.
 py::Ref item_field(py::Borrowed item, int index);
 
+// The four fields of a CScanItem-like object, read once: borrowed from a
+// tuple (kept alive by holding the item), fetched by name otherwise.
+class ItemFields {
+public:
+  explicit ItemFields(py::Borrowed item) : item_(item.ref()) {
+    if (PyTuple_Check(item.get()) && PyTuple_GET_SIZE(item.get()) == 4) {
+      for (int i = 0; i < 4; ++i)
+        v_[i] = PyTuple_GET_ITEM(item.get(), i);
+      return;
+    }
+    for (int i = 0; i < 4; ++i) {
+      owned_[i] = item_field(item, i);
+      v_[i] = owned_[i].get();
+    }
+  }
+  py::Borrowed operator[](int i) const { return py::Borrowed(v_[i]); }
+
+private:
+  py::Ref item_;
+  py::Ref owned_[4];
+  PyObject *v_[4] = {};
+};
+
 // Raise AssertionError (with an optional message), as a failed `assert`.
 [[noreturn]] void assertion_failed(const char *msg = nullptr);
 

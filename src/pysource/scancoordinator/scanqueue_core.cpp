@@ -724,8 +724,8 @@ void Clear(Q *q) {
 }
 
 void ScanCompleted(Q *q, Borrowed scan_item, Borrowed key) {
-  Ref loc = item_field(scan_item, 0), scope = item_field(scan_item, 1),
-      scan_name = item_field(scan_item, 2), priority = item_field(scan_item, 3);
+  const ItemFields fields(scan_item);
+  const Borrowed loc = fields[0], scope = fields[1], scan_name = fields[2], priority = fields[3];
   Ref done = make_scan_item(loc, scope, scan_name, Borrowed(Py_None));
   // Hashing the four-field record once serves the lookup and the store.
   Ref counts = q->f._fCompletedCount;

@@ -249,7 +249,26 @@ void SetScansToOrder(Q *q, Borrowed scans_to_order) {
 
 Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   Ref orders = q->f._fScansToOrder;
+  Ref queues = q->f._fOrderedQueues;
+  // The answer of the previous call stands while the scan name and priority
+  // are the same, the order table is the same dictionary at the same version
+  // (the host may change it in place), and the same single queue, with the
+  // same priority and order, is still at the same place in the list.  Most
+  // calls ask again for the single queue of the scan just handed out.
+  auto &last = q->f.last_single_queue;
+  if (last.queue && last.scan_name.get() == scan_name.get() && last.priority == priority &&
+      last.orders.get() == orders.get() &&
+      (!orders || !PyDict_Check(orders.get()) || py::dict_version(orders) == last.orders_version) &&
+      last.queues.get() == queues.get() && last.index < PyList_GET_SIZE(queues.get()) &&
+      PyList_GET_ITEM(queues.get(), last.index) == last.queue.get()) {
+    const auto *sq = reinterpret_cast<SingleQueueObject *>(last.queue.get());
+    if (sq->f.fPriority == priority && sq->f.fOrder == last.order)
+      return last.queue;
+  }
   long long order = 0;
+  // Taken before the lookup, which may run a scan name's __eq__.
+  const uint64_t orders_version =
+      orders && PyDict_Check(orders.get()) ? py::dict_version(orders) : 0;
   // A None table behaves as an empty one: every scan name has order 0.
   Ref found;
   if (orders && !orders.is_none())
@@ -259,13 +278,29 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   if (found)
     order = as_int64(found);
 
-  Ref queues = q->f._fOrderedQueues;
+  // A name without an order prints its diagnostic on every call, so its
+  // answer is not kept.
+  auto remember = [&](const Ref &sq, Py_ssize_t index) {
+    if (state->debug && !found)
+      return;
+    last.scan_name = scan_name.ref();
+    last.priority = priority;
+    last.order = order;
+    last.orders = orders;
+    last.orders_version = orders_version;
+    last.queues = queues;
+    last.index = index;
+    last.queue = sq;
+  };
   Py_ssize_t n = PyList_GET_SIZE(queues.get());
   Py_ssize_t insert_at = n;
   for (Py_ssize_t i = 0; i < n; ++i) {
     SingleQueueObject *sq = as_single_queue(PyList_GET_ITEM(queues.get(), i));
-    if (sq->f.fPriority == priority && sq->f.fOrder == order)
-      return Ref::borrow(reinterpret_cast<PyObject *>(sq));
+    if (sq->f.fPriority == priority && sq->f.fOrder == order) {
+      Ref found_sq = Ref::borrow(reinterpret_cast<PyObject *>(sq));
+      remember(found_sq, i);
+      return found_sq;
+    }
     if (sq->f.fPriority > priority || (sq->f.fPriority == priority && sq->f.fOrder > order)) {
       insert_at = i;
       break;
@@ -273,6 +308,7 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   }
   Ref sq = new_single_queue(scan_name, priority, order);
   py::check_int(PyList_Insert(queues.get(), insert_at, sq.get()));
+  remember(sq, insert_at);
   return sq;
 }
 

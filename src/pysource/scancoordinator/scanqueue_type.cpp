@@ -27,6 +27,10 @@ struct Fields : ScanQueueFields {
     f(_fVisibleDocLocs);
     f(_fGuiMgr);
     f(_fWholeFilesToCheck);
+    f(last_single_queue.scan_name);
+    f(last_single_queue.orders);
+    f(last_single_queue.queues);
+    f(last_single_queue.queue);
   }
   int visit(visitproc v, void *arg) {
     int r = 0;

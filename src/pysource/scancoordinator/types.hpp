@@ -54,6 +54,14 @@ struct ScanQueueFields {
   py::Ref _fVisibleDocLocs;
   py::Ref _fGuiMgr;
   py::Ref _fWholeFilesToCheck;
+  // The single queue that _GetSingleQueue returned last and what it was
+  // found for; see GetSingleQueue.
+  struct {
+    py::Ref scan_name, orders, queues, queue;
+    long long priority = 0, order = 0;
+    uint64_t orders_version = 0;
+    Py_ssize_t index = 0;
+  } last_single_queue;
 };
 
 struct ScanQueueObject {

@@ -272,8 +272,22 @@ bool CheckWholeFiles(C *c, double end_time) {
   ScanQueueObject *q = queue(c);
   Ref whole = sq::PopWholeFilesToCheck(q, kMaxWholeFilesPerCheck);
   while (!whole.is_none()) {
+    // check = dict(whole): the queue's (loc, priority) tuples stored directly.
     Ref check = py::new_dict();
-    py::check_int(PyDict_MergeFromSeq2(check.get(), whole.get(), 1));
+    bool pairs = PyList_CheckExact(whole.get());
+    for (Py_ssize_t i = 0; pairs && i < PyList_GET_SIZE(whole.get()); ++i) {
+      PyObject *t = PyList_GET_ITEM(whole.get(), i);
+      pairs = PyTuple_CheckExact(t) && PyTuple_GET_SIZE(t) == 2;
+    }
+    if (pairs) {
+      for (Py_ssize_t i = 0; i < PyList_GET_SIZE(whole.get()); ++i) {
+        Ref t = Ref::borrow(PyList_GET_ITEM(whole.get(), i));
+        py::dict_set(check, Borrowed(PyTuple_GET_ITEM(t.get(), 0)),
+                     Borrowed(PyTuple_GET_ITEM(t.get(), 1)));
+      }
+    } else {
+      py::check_int(PyDict_MergeFromSeq2(check.get(), whole.get(), 1));
+    }
     log(c, PY_NAME(msgs::kChecking), whole);
     Ref keys = py::check(PyDict_Keys(check.get()));
     Ref mtime_dict = call::GetModtimeDict(c, keys);
@@ -286,12 +300,18 @@ bool CheckWholeFiles(C *c, double end_time) {
       std::vector<std::pair<Ref, Ref>> items;
       Py_ssize_t pos = 0;
       PyObject *k, *v;
+      items.reserve(static_cast<size_t>(PyDict_GET_SIZE(mtime_dict.get())));
       while (PyDict_Next(mtime_dict.get(), &pos, &k, &v))
         items.emplace_back(Ref::borrow(k), Ref::borrow(v));
       Ref zero = py::integer(0);
       for (auto &kv : items) {
         py::dict_set(f._fMTimeAtLastWholeFileCheck, kv.first, kv.second);
-        if (py::eq(kv.second, zero))
+        // mtime == 0, for the float or int times the host gives, in C.
+        PyObject *t = kv.second.get();
+        const bool is_zero = PyFloat_CheckExact(t)  ? PyFloat_AS_DOUBLE(t) == 0.0
+                             : PyLong_CheckExact(t) ? Py_SIZE(t) == 0
+                                                    : py::eq(kv.second, zero);
+        if (is_zero)
           py::list_append(missing, kv.first);
         else
           py::dict_set(existing, kv.first, kv.second);
@@ -309,6 +329,7 @@ bool CheckWholeFiles(C *c, double end_time) {
       std::vector<std::pair<Ref, Ref>> items;
       Py_ssize_t pos = 0;
       PyObject *k, *v;
+      items.reserve(static_cast<size_t>(PyDict_GET_SIZE(scans_done.get())));
       while (PyDict_Next(scans_done.get(), &pos, &k, &v))
         items.emplace_back(Ref::borrow(k), Ref::borrow(v));
       for (auto &kv : items) {
@@ -359,6 +380,7 @@ bool CheckWholeFiles(C *c, double end_time) {
       std::vector<std::pair<Ref, Ref>> items;
       Py_ssize_t pos = 0;
       PyObject *k, *v;
+      items.reserve(static_cast<size_t>(PyDict_GET_SIZE(groups.get())));
       while (PyDict_Next(groups.get(), &pos, &k, &v))
         items.emplace_back(Ref::borrow(k), Ref::borrow(v));
       for (auto &kv : items) {

@@ -63,10 +63,21 @@ Ref PopWholeFilesToCheck(Q *q, Py_ssize_t max_files) {
   Ref whole = q->f._fWholeFilesToCheck;
   if (PyDict_GET_SIZE(whole.get()) == 0)
     return Ref::none();
-  static Ref *s_popitem = new Ref(PY_NAME("popitem"));
+  // dict.popitem itself, called on the table (an exact dict: the field is
+  // ours) without looking the method up for every file.
+  static PyObject *popitem = [] {
+    PyObject *m = PyDict_GetItemWithError(PyDict_Type.tp_dict, PY_NAME("popitem").get());
+    if (!m && !PyErr_Occurred())
+      PyErr_SetString(PyExc_SystemError, "dict.popitem not found");
+    if (!m)
+      py::throw_error();
+    return m; // lives as long as the dict type
+  }();
   Ref result = py::new_list();
   while (PyList_GET_SIZE(result.get()) <= max_files && PyDict_GET_SIZE(whole.get()) != 0)
-    py::list_append(result, py::call_method(whole, *s_popitem));
+    py::list_append(result, PyDict_CheckExact(whole.get())
+                                ? py::call(Borrowed(popitem), whole)
+                                : py::call_method(whole, PY_NAME("popitem")));
   if (!q->f.fAnyAsyncInspectLocation)
     return result;
   Ref ready = py::new_list();

@@ -584,17 +584,27 @@ bool remove_from_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrow
   Ref recorded = get_kh(info.pending, k, h);
   if (!recorded || !py::eq(recorded, priority))
     return false;
-  del_kh(info.pending, k, h);
-  if (PyDict_GET_SIZE(info.pending.get()) == 0) {
+  // Removing the location's last scan drops its whole record.  When nothing
+  // but the table and `info` holds the record and its two dictionaries,
+  // nobody can see them again, so they are dropped as they are instead of
+  // being emptied first.
+  const bool unseen = PyDict_GET_SIZE(info.pending.get()) == 1 &&
+                      PyTuple_CheckExact(info.tuple.get()) && Py_REFCNT(info.tuple.get()) == 2 &&
+                      Py_REFCNT(info.pending.get()) == 2 && Py_REFCNT(info.counts.get()) == 2;
+  if (!unseen)
+    del_kh(info.pending, k, h);
+  if (unseen || PyDict_GET_SIZE(info.pending.get()) == 0) {
     py::dict_del(q->f._fPerLocationInfo, loc);
     call::LocationRemoved(q, loc);
   }
   Ref old = py::dict_get(info.counts, scan_name);
   const long long per_loc = (old ? py::as_ll(old) : 0) - 1;
-  if (per_loc == 0)
-    py::dict_del(info.counts, scan_name);
-  else
+  if (per_loc == 0) {
+    if (!unseen)
+      py::dict_del(info.counts, scan_name);
+  } else {
     py::dict_set(info.counts, scan_name, py::integer(per_loc));
+  }
 
   Ref pair = py::dict_get(q->f._fPerScanNameCounts, scan_name);
   if (!pair) {
@@ -684,6 +694,12 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   PyListObject *l = as_name_list(name_list);
   Py_ssize_t i = bisect_left(name_list, scope);
   if (i < PyList_GET_SIZE(l) && py::eq(Borrowed(PyList_GET_ITEM(l, i)), scope)) {
+    // A list that only the mapping and we hold is dropped with its last name
+    // still in it: nobody can see it again.
+    if (PyList_GET_SIZE(l) == 1 && Py_REFCNT(name_list.get()) == 2) {
+      om::del(uod, loc);
+      return true;
+    }
     py::check_int(PyList_SetSlice(name_list.get(), i, i + 1, nullptr));
     if (PyList_GET_SIZE(l) == 0)
       om::del(uod, loc);

@@ -234,6 +234,17 @@ struct LocInfo {
 LocInfo loc_info(Q *q, Borrowed loc);
 // A name list as stored in a single queue (TypeError if not a list).
 PyListObject *as_name_list(Borrowed v);
+// Name lists and the cyclic GC.  A name list holds scope names, strs that
+// can be part of no cycle, so the queue keeps its lists untracked while they
+// hold only such names (as the collector does by itself for tuples and
+// dictionaries of atomic items): a batch of thousands of new locations then
+// leaves the collector nothing new to walk, and no full collection follows.
+// The list made for a first name; untracked unless the name is tracked.
+Ref new_name_list(Borrowed name);
+// After `name` was put into `list`: a tracked name tracks the list again.
+void name_added(Borrowed list, Borrowed name);
+// A list the queue filled with names: untracked if they are all atomic.
+void untrack_name_list(Borrowed list);
 // bisect.bisect_left(list, x)
 Py_ssize_t bisect_left(Borrowed list, Borrowed x);
 Ref make_key(Borrowed scope, Borrowed scan_name);

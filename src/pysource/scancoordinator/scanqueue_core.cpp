@@ -166,6 +166,32 @@ PyListObject *as_name_list(Borrowed v) {
   return reinterpret_cast<PyListObject *>(v.get());
 }
 
+namespace {
+bool gc_tracked(PyObject *o) { return PyObject_IS_GC(o) && PyObject_GC_IsTracked(o); }
+} // namespace
+
+Ref new_name_list(Borrowed name) {
+  Ref l = py::check(PyList_New(1));
+  PyList_SET_ITEM(l.get(), 0, name.ref().release());
+  if (!gc_tracked(name.get()))
+    PyObject_GC_UnTrack(l.get());
+  return l;
+}
+
+void name_added(Borrowed list, Borrowed name) {
+  if (gc_tracked(name.get()) && !PyObject_GC_IsTracked(list.get()))
+    PyObject_GC_Track(list.get());
+}
+
+void untrack_name_list(Borrowed list) {
+  if (!PyList_CheckExact(list.get()) || !PyObject_GC_IsTracked(list.get()))
+    return;
+  for (Py_ssize_t i = 0; i < PyList_GET_SIZE(list.get()); ++i)
+    if (gc_tracked(PyList_GET_ITEM(list.get(), i)))
+      return;
+  PyObject_GC_UnTrack(list.get());
+}
+
 Py_ssize_t bisect_left(Borrowed list, Borrowed x) {
   Py_ssize_t lo = 0, hi = PyList_GET_SIZE(list.get());
   const bool x_str = PyUnicode_CheckExact(x.get());
@@ -482,9 +508,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     const bool first = PySet_GET_SIZE(visible.get()) != 0 && py::set_contains(visible, loc);
     Ref name_list = om::get(uod, loc, first);
     if (!name_list) {
-      Ref l = py::check(PyList_New(1));
-      PyList_SET_ITEM(l.get(), 0, scope.ref().release());
-      om::set(uod, loc, l, first);
+      om::set(uod, loc, new_name_list(scope), first);
     } else {
       PyListObject *l = as_name_list(name_list);
       if (PyList_GET_SIZE(l) == 0) {
@@ -511,6 +535,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
           py::list_append(name_list, scope);
         else
           return;
+        name_added(name_list, scope);
       }
     }
     // 8. bookkeeping; 9. the whole-file check

@@ -253,6 +253,7 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
       om::del(from->f.fOrderedDict, loc);
     if (PyList_GET_SIZE(names.get()) == 0)
       return;
+    untrack_name_list(names);
   }
   as_name_list(names);
   Ref to_prio = priority_obj(to->f.fPriority);
@@ -281,6 +282,7 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
         Ref name = Ref::borrow(PyList_GET_ITEM(names.get(), i));
         Py_ssize_t at = bisect_left(target, name);
         py::check_int(PyList_Insert(target.get(), at, name.get()));
+        name_added(target, name);
       }
     }
   }

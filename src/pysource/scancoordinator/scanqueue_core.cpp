@@ -16,6 +16,8 @@
 #include "host/objectmodel.hpp"
 #include "host/orderedmap.hpp"
 
+#include <structmember.h>
+
 namespace scancoord::sq {
 
 namespace om = host::orderedmap;
@@ -88,14 +90,23 @@ Ref make_count_pair(long long scans, long long locs) {
 // dictionary.  Untracked, the (counts, pending) pair stays untracked too, so
 // the queue's per-location records cost the cyclic GC nothing.
 Ref new_counts_dict() {
-  // defaultdict(int), made by its type's own new and init with a prepared
-  // argument tuple rather than through a call that packs one each time.
+  // defaultdict(int) as `d = defaultdict(); d.default_factory = int`: the
+  // type's own new, then the factory stored through the type's member
+  // descriptor, instead of a call that packs and parses an argument tuple.
   auto *type = reinterpret_cast<PyTypeObject *>(state->defaultdict.get());
-  static Ref *args = new Ref(py::check(PyTuple_Pack(1, state->int_type.get())));
+  static PyMemberDef *factory = [type]() -> PyMemberDef * {
+    PyObject *descr = PyDict_GetItemWithError(type->tp_dict, PY_NAME("default_factory").get());
+    if (descr && Py_IS_TYPE(descr, &PyMemberDescr_Type))
+      return reinterpret_cast<PyMemberDescrObject *>(descr)->d_member;
+    PyErr_Clear();
+    return nullptr;
+  }();
   Ref d;
-  if (type->tp_new && type->tp_init) {
-    d = py::check(type->tp_new(type, args->get(), nullptr));
-    py::check_int(type->tp_init(d.get(), args->get(), nullptr));
+  if (factory && type->tp_new) {
+    static Ref *no_args = new Ref(py::check(PyTuple_New(0)));
+    d = py::check(type->tp_new(type, no_args->get(), nullptr));
+    py::check_int(
+        PyMember_SetOne(reinterpret_cast<char *>(d.get()), factory, state->int_type.get()));
   } else {
     d = py::call(state->defaultdict, state->int_type);
   }

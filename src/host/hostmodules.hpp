@@ -69,7 +69,8 @@ py::Ref attr(Attr a);
 // One call of the idle callback reads each attribute of `Attr` at most once:
 // the callback opens a Snapshot, and attr() keeps what it reads until the
 // snapshot closes.  A host or a test that replaces a module attribute is
-// seen from the next idle call on.  Snapshots do not nest: an inner one (a
+// seen from the next idle call on.  AddScanPairs, called from Python with a
+// batch of pairs, opens one for the batch in the same way.  Snapshots do not nest: an inner one (a
 // synchronous scan started by a collaborator inside the slice) shares the
 // outer one.  Main thread only, like everything on this boundary.
 class Snapshot {

@@ -3,6 +3,7 @@
 // __init__ has run, and calls the C++ logic in the scanqueue_* units.
 #include "pysource/scancoordinator/scanqueue.hpp"
 #include "pysource/scancoordinator/typeutil.hpp"
+#include "host/hostmodules.hpp"
 
 namespace scancoord {
 
@@ -106,6 +107,9 @@ SC_METHOD(SetScansToOrder){PY_GUARD(nullptr,
     PY_GUARD(nullptr,
              {
                SC_ARGS("AddScanPairs", 2, "pair_seq", "scan_name", "priority", "add_to_check");
+               // One call asks the location module's predicate for every pair:
+               // it is read from the module once for the call.
+               host::Snapshot snapshot;
                sq::AddScanPairs(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), flag(a[3], false));
                return none();
              })} SC_METHOD(_AddReadyScanPairs){

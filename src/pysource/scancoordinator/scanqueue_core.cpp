@@ -25,7 +25,10 @@ namespace om = host::orderedmap;
 // ---- helpers -------------------------------------------------------------
 
 Ref make_key(Borrowed scope, Borrowed scan_name) {
-  return untrack_if_atomic(py::check(PyTuple_Pack(2, scope.get(), scan_name.get())));
+  Ref key = py::check(PyTuple_New(2));
+  PyTuple_SET_ITEM(key.get(), 0, scope.ref().release());
+  PyTuple_SET_ITEM(key.get(), 1, scan_name.ref().release());
+  return untrack_if_atomic(std::move(key));
 }
 
 Ref priority_obj(long long p) {
@@ -48,18 +51,20 @@ bool is_wildcard(Borrowed scope) { return py::eq(scope, state->kWildcardScope); 
 
 // (scan count, location count) stored in _fPerScanNameCounts: read straight
 // from the tuple when it is the pair of ints the queue stores.
-void read_count_pair(Borrowed pair, long long &scans, long long &locs) {
+// Returns whether the pair is such a tuple.
+bool read_count_pair(Borrowed pair, long long &scans, long long &locs) {
   PyObject *p = pair.get();
   if (PyTuple_CheckExact(p) && PyTuple_GET_SIZE(p) == 2 &&
       PyLong_CheckExact(PyTuple_GET_ITEM(p, 0)) && PyLong_CheckExact(PyTuple_GET_ITEM(p, 1))) {
     scans = py::as_ll(Borrowed(PyTuple_GET_ITEM(p, 0)));
     locs = py::as_ll(Borrowed(PyTuple_GET_ITEM(p, 1)));
-    return;
+    return true;
   }
   Ref parts[2];
   unpack(pair, 2, parts);
   scans = py::as_ll(parts[0]);
   locs = py::as_ll(parts[1]);
+  return false;
 }
 
 // Lookups in a dictionary with the key's hash computed once by the caller:
@@ -119,23 +124,23 @@ Ref new_counts_dict() {
 // referenced by that dictionary alone (and the caller's `pair`), nobody can
 // observe it, so its items are replaced in place instead of allocating a new
 // tuple for every queued scan.
-void store_count_pair(Q *q, Borrowed scan_name, Ref &pair, long long scans, long long locs) {
-  if (pair && PyTuple_CheckExact(pair.get()) && PyTuple_GET_SIZE(pair.get()) == 2 &&
-      Py_REFCNT(pair.get()) == 2) {
+// `old` holds the values read from `pair` when read_count_pair found it to be
+// a tuple of two ints (nothing runs between that read and this store).
+struct CountPair {
+  long long scans, locs;
+};
+void store_count_pair(Q *q, Borrowed scan_name, Ref &pair, long long scans, long long locs,
+                      const CountPair *old) {
+  if (old && Py_REFCNT(pair.get()) == 2) {
     PyObject *t = pair.get();
     // Each item is replaced only when its value changed (the location count
     // rarely does); a replaced item is released once the tuple is consistent.
-    const long long values[2] = {scans, locs};
+    const long long values[2] = {scans, locs}, before[2] = {old->scans, old->locs};
     for (Py_ssize_t i = 0; i < 2; ++i) {
-      PyObject *item = PyTuple_GET_ITEM(t, i);
-      if (PyLong_CheckExact(item)) {
-        const long long v = PyLong_AsLongLong(item);
-        if (v == values[i])
-          continue;
-        PyErr_Clear(); // an out-of-range old value is simply replaced
-      }
+      if (values[i] == before[i])
+        continue;
       Ref fresh = py::integer(values[i]);
-      Ref old = Ref::steal(item);
+      Ref replaced = Ref::steal(PyTuple_GET_ITEM(t, i));
       PyTuple_SET_ITEM(t, i, fresh.release());
     }
     return;
@@ -589,14 +594,14 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
 
   long long scans = 0, locs = 0;
   Ref pair = py::dict_get(q->f._fPerScanNameCounts, scan_name);
-  if (pair)
-    read_count_pair(pair, scans, locs);
+  const bool exact = pair && read_count_pair(pair, scans, locs);
+  const CountPair old_pair{scans, locs};
   scans += 1;
   if (per_loc == 1)
     locs += 1;
   if (state->debug && scans < locs)
     assertion_failed();
-  store_count_pair(q, scan_name, pair, scans, locs);
+  store_count_pair(q, scan_name, pair, scans, locs, exact ? &old_pair : nullptr);
 }
 } // namespace
 
@@ -649,7 +654,8 @@ bool remove_from_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrow
     return true;
   }
   long long scans = 0, locs = 0;
-  read_count_pair(pair, scans, locs);
+  const bool exact = read_count_pair(pair, scans, locs);
+  const CountPair old_pair{scans, locs};
   scans -= 1;
   if (per_loc == 0)
     locs -= 1;
@@ -660,7 +666,7 @@ bool remove_from_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrow
   } else {
     if (state->debug && scans < locs)
       assertion_failed();
-    store_count_pair(q, scan_name, pair, scans, locs);
+    store_count_pair(q, scan_name, pair, scans, locs, exact ? &old_pair : nullptr);
   }
   return true;
 }

@@ -212,7 +212,7 @@ void DoScans(C *c, double end_time) {
       log(c, PY_NAME(msgs::kLocIsNone));
       return;
     }
-    Ref key = sq::make_key(scope, scan_name);
+    Ref key = sq::make_key(q, scope, scan_name);
     Ref times = f._fLastScanCompleted;
     Ref last = py::dict_get(times, loc);
     const uint64_t times_version = py::dict_version(times);

@@ -247,7 +247,9 @@ void name_added(Borrowed list, Borrowed name);
 void untrack_name_list(Borrowed list);
 // bisect.bisect_left(list, x)
 Py_ssize_t bisect_left(Borrowed list, Borrowed x);
-Ref make_key(Borrowed scope, Borrowed scan_name);
+// The (scope, scan name) key tuple, the queue's shared one for this pair of
+// name objects (see KeyTable).
+Ref make_key(Q *q, Borrowed scope, Borrowed scan_name);
 // A priority as stored: an int object of the given value.
 Ref priority_obj(long long p);
 

@@ -24,11 +24,15 @@ namespace om = host::orderedmap;
 
 // ---- helpers -------------------------------------------------------------
 
-Ref make_key(Borrowed scope, Borrowed scan_name) {
+Ref make_key(Q *q, Borrowed scope, Borrowed scan_name) {
+  if (PyObject *shared = q->f.keys.find(scope.get(), scan_name.get()))
+    return Ref::borrow(shared);
   Ref key = py::check(PyTuple_New(2));
   PyTuple_SET_ITEM(key.get(), 0, scope.ref().release());
   PyTuple_SET_ITEM(key.get(), 1, scan_name.ref().release());
-  return untrack_if_atomic(std::move(key));
+  key = untrack_if_atomic(std::move(key));
+  q->f.keys.add(scope.get(), scan_name.get(), key);
+  return key;
 }
 
 Ref priority_obj(long long p) {
@@ -384,7 +388,7 @@ Ref find_waiting_priority(Q *q, Borrowed loc) {
 Ref FindScanPriority(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed key) {
   LocInfo info = loc_info(q, loc);
   if (info) {
-    Ref k = key ? key.ref() : make_key(scope, scan_name);
+    Ref k = key ? key.ref() : make_key(q, scope, scan_name);
     return py::dict_get(info.pending, k);
   }
   return find_waiting_priority(q, loc);
@@ -490,7 +494,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
 
   pairs.for_each([&](PairRef lp) {
     Borrowed loc = lp.first, scope = lp.second;
-    Ref key = make_key(scope, scan_name);
+    Ref key = make_key(q, scope, scan_name);
     LocInfo info = loc_info(q, loc);
     // 1. already queued?  (The key's hash serves this lookup and the store.)
     Py_hash_t key_hash = -1;
@@ -513,7 +517,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     const bool scope_is_wild = is_wildcard(scope);
     if (!scope_is_wild) {
       if (!wild_key) {
-        wild_key = make_key(wildcard, scan_name);
+        wild_key = make_key(q, wildcard, scan_name);
         wild_hash = py::hash(wild_key);
       }
       Ref whole = info ? get_kh(info.pending, wild_key, wild_hash) : find_waiting_priority(q, loc);
@@ -608,7 +612,7 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
 void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
                              Borrowed priority, Borrowed key) {
   LocInfo info = loc_info(q, loc);
-  Ref k = key ? key.ref() : make_key(scope, scan_name);
+  Ref k = key ? key.ref() : make_key(q, scope, scan_name);
   add_to_per_location_map(q, loc, scan_name, priority, k, -1, info);
 }
 
@@ -677,7 +681,7 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   LocInfo info = loc_info(q, loc);
   if (!info)
     return false;
-  Ref k = key ? key.ref() : make_key(scope, scan_name);
+  Ref k = key ? key.ref() : make_key(q, scope, scan_name);
   return remove_from_per_location_map(q, loc, scan_name, priority, k, info);
 }
 

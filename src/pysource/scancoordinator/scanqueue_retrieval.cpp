@@ -287,7 +287,7 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
     }
   }
   for (Py_ssize_t i = 0; i < PyList_GET_SIZE(names.get()); ++i) {
-    Ref key = make_key(Borrowed(PyList_GET_ITEM(names.get(), i)), to_name);
+    Ref key = make_key(q, Borrowed(PyList_GET_ITEM(names.get(), i)), to_name);
     py::dict_set(info.pending, key, to_prio);
   }
 }

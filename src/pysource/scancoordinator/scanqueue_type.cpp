@@ -39,11 +39,12 @@ struct Fields : ScanQueueFields {
       if (!r)
         r = ref.visit(v, arg);
     });
-    return r;
+    return r ? r : keys.visit(v, arg);
   }
   void clear() {
     initialised = false;
     each([](py::Ref &ref) { ref.reset(); });
+    keys.clear();
   }
 };
 static_assert(sizeof(Fields) == sizeof(ScanQueueFields));

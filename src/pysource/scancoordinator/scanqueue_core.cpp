@@ -296,20 +296,22 @@ void SetScansToOrder(Q *q, Borrowed scans_to_order) {
 Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   Ref orders = q->f._fScansToOrder;
   Ref queues = q->f._fOrderedQueues;
-  // The answer of the previous call stands while the scan name and priority
-  // are the same, the order table is the same dictionary at the same version
-  // (the host may change it in place), and the same single queue, with the
-  // same priority and order, is still at the same place in the list.  Most
-  // calls ask again for the single queue of the scan just handed out.
-  auto &last = q->f.last_single_queue;
-  if (last.queue && last.scan_name.get() == scan_name.get() && last.priority == priority &&
-      last.orders.get() == orders.get() &&
-      (!orders || !PyDict_Check(orders.get()) || py::dict_version(orders) == last.orders_version) &&
-      last.queues.get() == queues.get() && last.index < PyList_GET_SIZE(queues.get()) &&
-      PyList_GET_ITEM(queues.get(), last.index) == last.queue.get()) {
-    const auto *sq = reinterpret_cast<SingleQueueObject *>(last.queue.get());
-    if (sq->f.fPriority == priority && sq->f.fOrder == last.order)
-      return last.queue;
+  // An earlier answer stands while the scan name and priority are the same,
+  // the order table is the same dictionary at the same version (the host may
+  // change it in place), and the same single queue, with the same priority
+  // and order, is still at the same place in the list.  Most calls ask again
+  // for the single queue of a scan just handed out or queued (the idle loop
+  // alternates between the primary and the secondary one).
+  for (const auto &a : q->f.single_queue_answers) {
+    if (a.queue && a.scan_name.get() == scan_name.get() && a.priority == priority &&
+        a.orders.get() == orders.get() &&
+        (!orders || !PyDict_Check(orders.get()) || py::dict_version(orders) == a.orders_version) &&
+        a.queues.get() == queues.get() && a.index < PyList_GET_SIZE(queues.get()) &&
+        PyList_GET_ITEM(queues.get(), a.index) == a.queue.get()) {
+      const auto *sq = reinterpret_cast<SingleQueueObject *>(a.queue.get());
+      if (sq->f.fPriority == priority && sq->f.fOrder == a.order)
+        return a.queue;
+    }
   }
   long long order = 0;
   // Taken before the lookup, which may run a scan name's __eq__.
@@ -329,6 +331,9 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   auto remember = [&](const Ref &sq, Py_ssize_t index) {
     if (state->debug && !found)
       return;
+    auto &last = q->f.single_queue_answers[q->f.next_single_queue_answer];
+    q->f.next_single_queue_answer =
+        (q->f.next_single_queue_answer + 1) % ScanQueueFields::kSingleQueueAnswers;
     last.scan_name = scan_name.ref();
     last.priority = priority;
     last.order = order;

@@ -28,10 +28,12 @@ struct Fields : ScanQueueFields {
     f(_fVisibleDocLocs);
     f(_fGuiMgr);
     f(_fWholeFilesToCheck);
-    f(last_single_queue.scan_name);
-    f(last_single_queue.orders);
-    f(last_single_queue.queues);
-    f(last_single_queue.queue);
+    for (auto &a : single_queue_answers) {
+      f(a.scan_name);
+      f(a.orders);
+      f(a.queues);
+      f(a.queue);
+    }
   }
   int visit(visitproc v, void *arg) {
     int r = 0;

@@ -103,14 +103,17 @@ struct ScanQueueFields {
   py::Ref _fGuiMgr;
   py::Ref _fWholeFilesToCheck;
   KeyTable keys;
-  // The single queue that _GetSingleQueue returned last and what it was
-  // found for; see GetSingleQueue.
-  struct {
+  // The single queues that _GetSingleQueue returned last and what each was
+  // found for (replaced in turn); see GetSingleQueue.
+  struct SingleQueueAnswer {
     py::Ref scan_name, orders, queues, queue;
     long long priority = 0, order = 0;
     uint64_t orders_version = 0;
     Py_ssize_t index = 0;
-  } last_single_queue;
+  };
+  static constexpr int kSingleQueueAnswers = 4;
+  SingleQueueAnswer single_queue_answers[kSingleQueueAnswers];
+  int next_single_queue_answer = 0;
 };
 
 struct ScanQueueObject {

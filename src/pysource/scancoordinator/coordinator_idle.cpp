@@ -403,8 +403,8 @@ bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
     C *c;
     ~Reset() { c->f.fActiveScanItem = Ref::none(); }
   } reset{c};
-  Ref loc = item_field(scan_item, 0), scope = item_field(scan_item, 1),
-      scan_name = item_field(scan_item, 2);
+  const ItemFields fields(scan_item, 0b0111);
+  const Borrowed loc = fields[0], scope = fields[1], scan_name = fields[2];
   const bool whole_file = py::eq(scope, state->kWildcardScope);
   bool result;
   if (py::eq(scan_name, host::anamgr::PrimaryScanName(f.fAnaMgr))) {

@@ -83,8 +83,8 @@ Ref new_scanner(host::Attr cls, Borrowed a, Borrowed b, Borrowed incomplete, Bor
 bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
   Ref ana_mgr = py::getattr(f.fSingletons, PY_NAME("fAnalysisMgr"));
-  Ref loc = item_field(scan_item, 0), scan_name = item_field(scan_item, 2),
-      priority = item_field(scan_item, 3);
+  const ItemFields fields(scan_item, 0b1101);
+  const Borrowed loc = fields[0], scan_name = fields[2], priority = fields[3];
   Ref active = f.fActivePrimaryWholeFileScanners;
   Ref scanner = py::dict_get(active, loc);
   if (!scanner) {
@@ -140,8 +140,8 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
 
 bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
-  Ref loc = item_field(scan_item, 0), scope = item_field(scan_item, 1),
-      priority = item_field(scan_item, 3);
+  const ItemFields fields(scan_item, 0b1011);
+  const Borrowed loc = fields[0], scope = fields[1], priority = fields[3];
   Ref symbolinfo = host::modules->symbolinfo;
   if (py::truth(py::call(py::getattr(symbolinfo, PY_NAME("IsInstanceScope")), scope))) {
     call::BuildInstanceScopeNoScanning(c, loc, scope, end_time);
@@ -214,7 +214,8 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
 
 bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
-  Ref loc = item_field(scan_item, 0), scan_name = item_field(scan_item, 2);
+  const ItemFields fields(scan_item, 0b0101);
+  const Borrowed loc = fields[0], scan_name = fields[2];
   if (!host::infocache::WantDerivedInfo(f._fInfoCache, loc))
     return false;
   Ref base = host::attr(host::Attr::CScanner);

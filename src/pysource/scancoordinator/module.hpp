@@ -66,17 +66,22 @@ inline py::Ref untrack_if_atomic(py::Ref t) {
 // index (its fields are positional), anything else by attribute name.
 py::Ref item_field(py::Borrowed item, int index);
 
-// The four fields of a CScanItem-like object, read once: borrowed from a
-// tuple (kept alive by holding the item), fetched by name otherwise.
+// The fields of a CScanItem-like object, read once: borrowed from a tuple
+// (kept alive by holding the item, whose items cannot be replaced), fetched
+// by name otherwise.  `wanted` (bit i for field i) names the fields the caller
+// reads, so that an object that is not a tuple sees only those attribute
+// reads, in field order; the others stay null.
 class ItemFields {
 public:
-  explicit ItemFields(py::Borrowed item) : item_(item.ref()) {
+  explicit ItemFields(py::Borrowed item, unsigned wanted = 0xF) : item_(item.ref()) {
     if (PyTuple_Check(item.get()) && PyTuple_GET_SIZE(item.get()) == 4) {
       for (int i = 0; i < 4; ++i)
         v_[i] = PyTuple_GET_ITEM(item.get(), i);
       return;
     }
     for (int i = 0; i < 4; ++i) {
+      if (!(wanted & (1u << i)))
+        continue;
       owned_[i] = item_field(item, i);
       v_[i] = owned_[i].get();
     }

@@ -32,6 +32,8 @@ using Q = ScanQueueObject;
 using py::Borrowed;
 using py::Ref;
 
+struct LocInfo;
+
 // ---- structure, adding and removing --------------------------------------
 void init(Q *q, Borrowed location_data_cache);
 void SetScansToOrder(Q *q, Borrowed scans_to_order);
@@ -161,8 +163,10 @@ void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_n
                              Borrowed priority, Borrowed key);
 bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
                                   Borrowed priority, Borrowed key);
+// `known` is the location's record when the caller has just read it; it is
+// used only if it is still current.
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key);
+                      bool remove_waiting, Borrowed key, const LocInfo *known = nullptr);
 void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting);
 // RemoveAllForLocations([loc], ...), without the one-item sequence.
 void RemoveAllForLocation(Q *q, Borrowed loc, Borrowed scan_name_set, bool remove_waiting);
@@ -214,7 +218,7 @@ void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowe
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key);
+                      bool remove_waiting, Borrowed key, const LocInfo *known = nullptr);
 Ref FirstOrNone(Q *q);
 void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set);
 void LocationAdded(Q *q, Borrowed loc);
@@ -227,9 +231,15 @@ void Clear(Q *q);
 
 // ---- shared helpers ------------------------------------------------------
 // The (counts, pending) pair stored for a location; both empty if absent.
+// `table` and `version` say which state of _fPerLocationInfo it was read
+// from: while that dictionary is unchanged, a new lookup would find the same
+// record (a tuple, whose two dictionaries cannot be swapped for others).
 struct LocInfo {
   Ref tuple, counts, pending;
+  PyObject *table = nullptr;
+  uint64_t version = 0;
   explicit operator bool() const { return bool(tuple); }
+  bool current(const Q *q) const;
 };
 LocInfo loc_info(Q *q, Borrowed loc);
 // A name list as stored in a single queue (TypeError if not a list).

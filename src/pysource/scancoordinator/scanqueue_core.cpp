@@ -165,7 +165,12 @@ void write_scan_without_order(Borrowed scan_name) {
 
 LocInfo loc_info(Q *q, Borrowed loc) {
   LocInfo info;
-  Ref t = py::dict_get(q->f._fPerLocationInfo, loc);
+  Ref table = q->f._fPerLocationInfo;
+  Ref t = py::dict_get(table, loc);
+  // The state read from: taken after the lookup, which may have run a
+  // location's __eq__.
+  info.table = table.get();
+  info.version = py::dict_version(table);
   if (!t)
     return info;
   Ref parts[2];
@@ -176,6 +181,11 @@ LocInfo loc_info(Q *q, Borrowed loc) {
   require_dict(info.pending);
   info.tuple = std::move(t);
   return info;
+}
+
+bool LocInfo::current(const Q *q) const {
+  return table && q->f._fPerLocationInfo.get() == table &&
+         py::dict_version(Borrowed(table)) == version;
 }
 
 PyListObject *as_name_list(Borrowed v) {
@@ -512,7 +522,7 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
     }
     if (existing) {
       if (as_int64(existing) > p) {
-        call::RemoveScanTriple(q, loc, scope, scan_name, existing, true, key);
+        call::RemoveScanTriple(q, loc, scope, scan_name, existing, true, key, &info);
         info = loc_info(q, loc); // the removal may have dropped the entry
       } else {
         return;
@@ -691,7 +701,7 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
 }
 
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key) {
+                      bool remove_waiting, Borrowed key, const LocInfo *known) {
   Ref waiting = q->f._fWaitingForInspectByLoc;
   if (remove_waiting && PyDict_GET_SIZE(waiting.get()) != 0) {
     Ref entry = py::dict_get(waiting, loc);
@@ -734,8 +744,20 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
     if (!prio || prio.is_none())
       return false;
   }
-  if (!RemoveScanFromPerLocationMap(q, loc, scope, scan_name, prio, key))
-    return false;
+  {
+    // _RemoveScanFromPerLocationMap, with the caller's record when it is
+    // still the one a lookup would find.
+    LocInfo fresh;
+    if (!known || !known->current(q)) {
+      fresh = loc_info(q, loc);
+      known = &fresh;
+    }
+    if (!*known)
+      return false;
+    Ref k = key ? key.ref() : make_key(q, scope, scan_name);
+    if (!remove_from_per_location_map(q, loc, scan_name, prio, k, *known))
+      return false;
+  }
   Ref sq_obj = call::GetSingleQueue(q, scan_name, as_int64(prio));
   SingleQueueObject *sq = as_single_queue(sq_obj.get());
   Ref uod = sq->f.fOrderedDict;
@@ -793,7 +815,8 @@ void RemoveAllForLocation(Q *q, Borrowed loc_b, Borrowed scan_name_set, bool rem
         take = r != 0;
       }
       if (take)
-        call::RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first);
+        call::RemoveScanTriple(q, loc, parts[0], parts[1], kv.second, remove_waiting, kv.first,
+                               &info);
       else
         kept = true;
     }

@@ -446,10 +446,10 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
   py::call(ov, pair_list(pairs), scan_name, or_none_b(priority), pybool(add_to_check));
 }
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key) {
+                      bool remove_waiting, Borrowed key, const LocInfo *known) {
   py::Ref ov;
   if (own(q, PY_NAME("RemoveScanTriple"), m_RemoveScanTriple, ov))
-    return sq::RemoveScanTriple(q, loc, scope, scan_name, priority, remove_waiting, key);
+    return sq::RemoveScanTriple(q, loc, scope, scan_name, priority, remove_waiting, key, known);
   py::Ref triple = py::check(PyTuple_Pack(3, loc.get(), scope.get(), scan_name.get()));
   return py::truth(py::call(ov, triple, or_none_b(priority), pybool(remove_waiting)));
 }

@@ -2,6 +2,7 @@
 """Scan-queue benchmark: the compiled _CScanQueue against the pure-Python one.
 
     ./run bench queue [--repeat N] [--locations N] [--impl compiled|reference] [--gc]
+                      [--clock wall|cpu]
 
 Workloads, on LOCATIONS files x 3 scope names under one scan name:
   add        AddScanPairs of every pair in one call, priority 2, add_to_check
@@ -12,7 +13,10 @@ Workloads, on LOCATIONS files x 3 scope names under one scan name:
              process each time so that memory freed by earlier runs cannot hide it
 
 Each workload runs on a fresh queue per repetition; the table shows medians.  The
-garbage collector is off while a workload is timed (as timeit does) unless --gc.
+garbage collector is off while a workload is timed (as timeit does) unless --gc; with
+--gc the collections each workload triggered are shown per generation (gen2 is a full
+collection: a walk over the whole heap).  --clock cpu times with the thread's CPU time
+instead of wall time (for a machine shared with other load).
 """
 import argparse
 import gc
@@ -59,28 +63,33 @@ def make_pairs(locs):
 
 
 class Bench:
-    def __init__(self, module, n_locations, keep_gc):
+    def __init__(self, module, n_locations, keep_gc, clock=time.perf_counter_ns):
         self.module = module
         self.locs = make_locations(n_locations)
         self.pairs = make_pairs(self.locs)
         self.keep_gc = keep_gc
+        self.clock = clock
         self.cache = FakeLocationDataCache()
+        self.collections = {}
 
     def new_queue(self):
         q = self.module._CScanQueue(self.cache)
         q.SetScansToOrder({kScanName: 0})
         return q
 
-    def timed(self, fn):
+    def timed(self, name, fn):
         gc.collect()
         if not self.keep_gc:
             gc.disable()
         try:
-            t0 = time.perf_counter_ns()
+            before = [g['collections'] for g in gc.get_stats()]
+            t0 = self.clock()
             fn()
-            elapsed = time.perf_counter_ns() - t0
+            elapsed = self.clock() - t0
+            after = [g['collections'] for g in gc.get_stats()]
         finally:
             gc.enable()
+        self.collections.setdefault(name, []).append(tuple(a - b for a, b in zip(after, before)))
         ostrelgtk.run_until_idle()
         return elapsed / len(self.pairs)
 
@@ -89,9 +98,9 @@ class Bench:
         pairs = self.pairs
         q = self.new_queue()
         result = {}
-        result['add'] = self.timed(lambda: q.AddScanPairs(pairs, kScanName, 2, True))
+        result['add'] = self.timed('add', lambda: q.AddScanPairs(pairs, kScanName, 2, True))
         assert q.GetFileCount(kScanName, 2) == len(self.locs)
-        result['promote'] = self.timed(lambda: q.AddScanPairs(pairs, kScanName, 1, True))
+        result['promote'] = self.timed('promote', lambda: q.AddScanPairs(pairs, kScanName, 1, True))
         assert q.GetFileCount(kScanName, 1) == len(self.locs)
         assert q.GetFileCount(kScanName, 2) == 0
 
@@ -103,11 +112,11 @@ class Bench:
                     break
                 ScanCompleted(item)
 
-        result['drain'] = self.timed(drain)
+        result['drain'] = self.timed('drain', drain)
         assert q.Empty()
         q.AddScanPairs(pairs, kScanName, 2, True)
         ostrelgtk.run_until_idle()
-        result['remove'] = self.timed(lambda: q.RemoveAllForLocations(self.locs))
+        result['remove'] = self.timed('remove', lambda: q.RemoveAllForLocations(self.locs))
         assert q.Empty()
         q.destroy()
         ostrelgtk.run_until_idle()
@@ -152,6 +161,8 @@ def main(argv):
     parser.add_argument('--impl', choices=['compiled', 'reference'], action='append',
                         help='run one implementation only (default: both)')
     parser.add_argument('--gc', action='store_true', help='keep the cyclic GC on while timing')
+    parser.add_argument('--clock', choices=['wall', 'cpu'], default='wall',
+                        help='time with wall time (default) or the thread\'s CPU time')
     parser.add_argument('--memory-child', choices=['compiled', 'reference'],
                         help=argparse.SUPPRESS)
     args = parser.parse_args(argv)
@@ -163,8 +174,11 @@ def main(argv):
     impls = args.impl or ['compiled', 'reference']
 
     medians = {}
+    collections = {}
     for impl in impls:
-        bench = Bench(load(impl), args.locations, args.gc)
+        clock = time.thread_time_ns if args.clock == 'cpu' else time.perf_counter_ns
+        bench = Bench(load(impl), args.locations, args.gc, clock)
+        collections[impl] = bench.collections
         runs = [bench.run_once() for _ in range(args.repeat)]
         medians[impl] = {w: statistics.median(r[w] for r in runs) for w in runs[0]}
         medians[impl]['memory'] = statistics.median(
@@ -173,7 +187,7 @@ def main(argv):
     n_scans = args.locations * len(kScopes)
     print(f'scan queue: {args.locations} files x {len(kScopes)} scopes = {n_scans} scans, '
           f'one scan name; median of {args.repeat} runs; '
-          f'GC {"on" if args.gc else "off"} while timed')
+          f'GC {"on" if args.gc else "off"} while timed; {args.clock} time')
     header = ('workload', 'compiled ns/scan', 'reference ns/scan', 'ratio', 'target')
     rows = []
     missed = []
@@ -194,6 +208,13 @@ def main(argv):
         print('  '.join(str(cell).rjust(w) if i else str(cell).ljust(w)
                         for i, (cell, w) in enumerate(zip(row, widths))))
     print('ratio: reference / compiled.  memory column: bytes of resident set per queued scan.')
+    if args.gc:
+        print('collections while timed (gen0/gen1/gen2, median over runs):')
+        for impl in impls:
+            print(f'  {impl}: ' + ', '.join(
+                f'{w} ' + '/'.join(f'{statistics.median(c[i] for c in counts):g}'
+                                   for i in range(3))
+                for w, counts in collections[impl].items()))
     if 'compiled' in medians:
         print('compiled misses target: ' + (', '.join(missed) if missed else 'none'))
     return 0

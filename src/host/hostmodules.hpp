@@ -46,4 +46,51 @@ struct Names {
 
 Names &names();
 
+// Module attributes that the idle loop reaches on every scan.
+enum class Attr : int {
+  kWaitingForData, // scopescanner
+  kFinishedScanning,
+  kScanAbandoned,
+  CWholeFilePrimaryScanner,
+  CSingleScopePrimaryScanner,
+  CWholeFileSecondaryScanner,
+  CSingleScopeSecondaryScanner,
+  CScanner,
+  IsAsyncInspectLocation, // ostrelbase.location
+  IsPythonSource,         // utils
+  CPySourceAnalysis,      // analysis
+  kCount
+};
+
+// The attribute as the module holds it now, or, while a Snapshot is open, as
+// it held it when first read under that snapshot.
+py::Ref attr(Attr a);
+
+// One call of the idle callback reads each attribute of `Attr` at most once:
+// the callback opens a Snapshot, and attr() keeps what it reads until the
+// snapshot closes.  A host or a test that replaces a module attribute is
+// seen from the next idle call on.  AddScanPairs, called from Python with a
+// batch of pairs, opens one for the batch in the same way.  Snapshots do not nest: an inner one (a
+// synchronous scan started by a collaborator inside the slice) shares the
+// outer one.  Main thread only, like everything on this boundary.
+class Snapshot {
+public:
+  Snapshot() noexcept;
+  ~Snapshot();
+  Snapshot(const Snapshot &) = delete;
+  Snapshot &operator=(const Snapshot &) = delete;
+
+  // The float object of `t`; the same object for repeated calls with the
+  // same value while the snapshot is open (a slice's deadline is passed to
+  // every scanner of the slice).
+  static py::Ref floating(double t);
+
+private:
+  friend py::Ref attr(Attr a);
+  bool active_ = false;
+  py::Ref values_[static_cast<int>(Attr::kCount)];
+  double float_value_ = 0.0;
+  py::Ref float_obj_;
+};
+
 } // namespace host

@@ -5,7 +5,7 @@
 namespace host::locations {
 
 bool IsAsyncInspectLocation(py::Borrowed loc) {
-  py::Ref f = py::module_attr(modules->location, names().IsAsyncInspectLocation);
+  py::Ref f = attr(Attr::IsAsyncInspectLocation);
   return py::truth(py::call(f, loc));
 }
 

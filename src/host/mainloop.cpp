@@ -18,7 +18,7 @@ py::Ref idle_add(py::Borrowed callback, py::Borrowed priority) {
 }
 
 py::Ref idle_add_while_alive(py::Borrowed callback, py::Borrowed owner) {
-  static py::Ref *name = new py::Ref(py::interned("idle_add_while_alive"));
+  static py::Ref *name = new py::Ref(PY_NAME("idle_add_while_alive"));
   return py::call(fn(*name), callback, owner);
 }
 

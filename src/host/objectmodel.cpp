@@ -56,9 +56,8 @@ void destroy(py::Borrowed obj) {
     if (Py_TYPE(obj.get()) == g_api->type) {
       own_destroy = true;
     } else {
-      py::Ref found = py::getattr(py::Borrowed(reinterpret_cast<PyObject *>(Py_TYPE(obj.get()))),
-                                  names().destroy);
-      own_destroy = found.get() == base_destroy;
+      // The type's own attribute, found through the type's method cache.
+      own_destroy = _PyType_Lookup(Py_TYPE(obj.get()), names().destroy.get()) == base_destroy;
     }
   }
   if (own_destroy) {

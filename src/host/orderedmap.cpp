@@ -34,7 +34,7 @@ const CUsageOrderedDict_CAPI &api() { return *g_api; }
 
 py::Ref create() {
   // Looked up on the module so that a replacement class is honoured.
-  static py::Ref *name = new py::Ref(py::interned("CUsageOrderedDict"));
+  static py::Ref *name = new py::Ref(PY_NAME("CUsageOrderedDict"));
   py::Ref cls = py::getattr(modules->usageordereddict, *name);
   if (cls.get() == reinterpret_cast<PyObject *>(g_api->type))
     return py::check(g_api->create());
@@ -114,9 +114,9 @@ bool first(py::Borrowed d, py::Ref &key, py::Ref &value) {
     value = py::Ref::borrow(v);
     return true;
   }
-  static py::Ref *s_first = new py::Ref(py::interned("_fFirst"));
-  static py::Ref *s_key = new py::Ref(py::interned("key"));
-  static py::Ref *s_val = new py::Ref(py::interned("val"));
+  static py::Ref *s_first = new py::Ref(PY_NAME("_fFirst"));
+  static py::Ref *s_key = new py::Ref(PY_NAME("key"));
+  static py::Ref *s_val = new py::Ref(PY_NAME("val"));
   py::Ref entry = py::getattr(d, *s_first);
   if (entry.is_none())
     return false;

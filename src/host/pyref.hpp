@@ -18,7 +18,6 @@
 #include <cstdint>
 #include <cstring>
 #include <exception>
-#include <unordered_map>
 #include <utility>
 
 namespace py {
@@ -161,26 +160,22 @@ inline void translate_exception() noexcept {
 
 inline Ref str(const char *s) { return check(PyUnicode_FromString(s)); }
 
-// The interned str of a constant C string (an attribute, signal or message
-// name), created once and kept for the life of the process: hot paths look
-// names up without building a new string each time.  The cache is keyed by
-// the literal's address and checked against its text, so a reused buffer
-// can never return a stale name.  Called with the GIL held, like all of this.
-inline PyObject *intern_cached(const char *s) {
-  static auto *cache = new std::unordered_map<const char *, PyObject *>();
-  auto it = cache->find(s);
-  if (it != cache->end()) {
-    const char *text = PyUnicode_AsUTF8(it->second);
-    if (text && std::strcmp(text, s) == 0)
-      return it->second;
-  }
-  PyObject *u = PyUnicode_InternFromString(s);
-  if (!u)
-    throw_error();
-  (*cache)[s] = u; // a replaced entry stays alive: someone may still borrow it
-  return u;
-}
-inline Ref interned(const char *s) { return Ref::borrow(intern_cached(s)); }
+// A new reference to the interned str of `s`.  Interning decodes the text
+// and looks it up in the interpreter's table, so this is for one-time setup;
+// code that runs repeatedly names things with PY_NAME.
+inline Ref intern(const char *s) { return check(PyUnicode_InternFromString(s)); }
+
+// The interned str of a constant text (an attribute, method, signal or
+// message name), made the first time this call site runs and kept for the
+// life of the process: afterwards naming it costs one load, with no
+// conversion or comparison of C strings.  `text` must be a constant
+// expression; a failed first creation throws and is retried next time.
+#define PY_NAME(text)                                                                              \
+  (::py::Borrowed([]() -> PyObject * {                                                             \
+    static PyObject *const name_ = ::py::intern(text).release();                                   \
+    return name_;                                                                                  \
+  }()))
+
 inline Ref integer(long long v) { return check(PyLong_FromLongLong(v)); }
 inline Ref floating(double v) { return check(PyFloat_FromDouble(v)); }
 
@@ -197,9 +192,6 @@ inline bool truth(Borrowed o) {
 
 inline Ref getattr(Borrowed o, Borrowed name) {
   return check(PyObject_GetAttr(o.get(), name.get()));
-}
-inline Ref getattr(Borrowed o, const char *name) {
-  return check(PyObject_GetAttr(o.get(), intern_cached(name)));
 }
 inline void setattr(Borrowed o, Borrowed name, Borrowed v) {
   check_int(PyObject_SetAttr(o.get(), name.get(), v.get()));
@@ -255,9 +247,13 @@ inline Py_hash_t hash(Borrowed o) {
   return h;
 }
 
+// a == b: identity first; two exact strs compare as text without the rich
+// comparison protocol; anything else through ==.
 inline bool eq(Borrowed a, Borrowed b) {
   if (a.get() == b.get())
     return true;
+  if (PyUnicode_CheckExact(a.get()) && PyUnicode_CheckExact(b.get()))
+    return _PyUnicode_EQ(a.get(), b.get()) != 0;
   int r = PyObject_RichCompareBool(a.get(), b.get(), Py_EQ);
   if (r < 0)
     throw_error();
@@ -289,6 +285,11 @@ inline bool dict_contains(Borrowed d, Borrowed key) {
   return r != 0;
 }
 inline void dict_del(Borrowed d, Borrowed key) { check_int(PyDict_DelItem(d.get(), key.get())); }
+// The dictionary's version tag: it changes whenever the dictionary changes,
+// so a value looked up earlier is still current while the tag is the same.
+inline uint64_t dict_version(Borrowed d) {
+  return reinterpret_cast<PyDictObject *>(d.get())->ma_version_tag;
+}
 
 inline bool set_contains(Borrowed s, Borrowed key) {
   int r = PySet_Contains(s.get(), key.get());
@@ -307,8 +308,28 @@ inline bool set_discard(Borrowed s, Borrowed key) {
 inline void list_append(Borrowed l, Borrowed v) { check_int(PyList_Append(l.get(), v.get())); }
 
 // Iterate any iterable: for_each(obj, [&](Borrowed item){...}).
-// for_each_while stops early when f returns false.
+// for_each_while stops early when f returns false.  Exact tuples and lists
+// are walked by index, without an iterator object.
 template <typename F> void for_each_while(Borrowed iterable, F &&f) {
+  PyObject *o = iterable.get();
+  if (PyTuple_CheckExact(o)) {
+    Ref keep = iterable.ref();
+    for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(o); ++i)
+      if (!f(Borrowed(PyTuple_GET_ITEM(o, i))))
+        return;
+    return;
+  }
+  if (PyList_CheckExact(o)) {
+    // As a list iterator walks it: by index, the length read at every step,
+    // each item held while f runs.
+    Ref keep = iterable.ref();
+    for (Py_ssize_t i = 0; i < PyList_GET_SIZE(o); ++i) {
+      Ref item = Ref::borrow(PyList_GET_ITEM(o, i));
+      if (!f(item.borrowed()))
+        return;
+    }
+    return;
+  }
   Ref it = check(PyObject_GetIter(iterable.get()));
   for (;;) {
     Ref item = Ref::steal(PyIter_Next(it.get()));

@@ -4,7 +4,6 @@
 
 namespace host::scanners {
 
-py::Ref State(const char *name) { return py::getattr(modules->scopescanner, name); }
-py::Ref Class(const char *name) { return py::getattr(modules->scopescanner, name); }
+py::Ref Class(py::Borrowed name) { return py::getattr(modules->scopescanner, name); }
 
 } // namespace host::scanners

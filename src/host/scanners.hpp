@@ -1,14 +1,14 @@
-// Scanner classes and states of the engine's scope scanner module, looked up
-// on the module at each use so that a host or a test can replace them.
+// Functions of the engine's scope scanner module that only the synchronous
+// scans use, looked up on the module at each use so that a host or a test can
+// replace them.  The scanner classes and states the idle loop uses on every
+// scan are host::attr() entries (hostmodules.hpp).
 #pragma once
 
 #include "host/pyref.hpp"
 
 namespace host::scanners {
 
-// A state constant of pysource.scopescanner (kWaitingForData, ...).
-py::Ref State(const char *name);
-// A scanner class of pysource.scopescanner.
-py::Ref Class(const char *name);
+// An attribute of pysource.scopescanner (CreateClassInstInfo, ...).
+py::Ref Class(py::Borrowed name);
 
 } // namespace host::scanners

@@ -425,7 +425,7 @@ py::Ref connect_impl(CDestroyableObject *self, py::Borrowed signal, py::Borrowed
 namespace {
 void make_globals() {
   auto globals = std::make_unique<Globals>();
-  globals->destroy_impl_name = py::interned("_destroy_impl");
+  globals->destroy_impl_name = PY_NAME("_destroy_impl");
   globals->class_gone = py::check(PyCFunction_New(&class_gone_def, nullptr));
   g = globals.release();
 }

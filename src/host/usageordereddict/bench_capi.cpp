@@ -50,7 +50,7 @@ Op parse_op(PyObject *name) {
 }
 
 const CUsageOrderedDict_CAPI *api_of(PyObject *module) {
-  py::Ref capsule = py::getattr(py::Borrowed(module), "_C_API");
+  py::Ref capsule = py::getattr(py::Borrowed(module), PY_NAME("_C_API"));
   void *p = PyCapsule_GetPointer(capsule.get(), CUSAGEORDEREDDICT_CAPSULE_NAME);
   if (!p)
     py::throw_error();

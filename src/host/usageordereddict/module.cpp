@@ -230,7 +230,7 @@ Signature g_pop_sig = {"pop", {"key", "default"}, 1, 2, {}};
 
 void intern_params(Signature &sig) {
   for (int k = 0; k < sig.max; ++k)
-    sig.interned[k] = py::interned(sig.params[k]).release(); // kept for the process's life
+    sig.interned[k] = py::intern(sig.params[k]).release(); // kept for the process's life
 }
 
 // ---- entry snapshots (_fFirst / _fLast) ------------------------------------------
@@ -497,9 +497,8 @@ py::Ref repr_impl(PyObject *self) {
   if (scope.recursive())
     return py::check(PyUnicode_FromFormat("%U(...)", name.get()));
   // Snapshot the pairs first: the reprs of keys and values may mutate us.
-  py::Ref items = Py_IS_TYPE(self, g_type)
-                      ? new_iter(self, IterKind::kItems)
-                      : py::call_method(py::Borrowed(self), py::interned("items"));
+  py::Ref items = Py_IS_TYPE(self, g_type) ? new_iter(self, IterKind::kItems)
+                                           : py::call_method(py::Borrowed(self), PY_NAME("items"));
   py::Ref pairs = py::check(PySequence_List(items.get()));
   if (PyList_GET_SIZE(pairs.get()) == 0)
     return py::check(PyUnicode_FromFormat("%U()", name.get()));

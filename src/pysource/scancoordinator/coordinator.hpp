@@ -137,6 +137,8 @@ void CancelIdle(C *c);
 // ---- queueing interface --------------------------------------------------
 void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority);
 void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority);
+// AddPairsToSecondaryQueue([(loc, scope)], first, priority) without the list.
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first, Borrowed priority);
 void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set);
 void AddParseablesToQueue(C *c, Borrowed loc_seq, Borrowed priority);
 bool QueueBasicModules(C *c, Borrowed end_time);
@@ -156,8 +158,8 @@ bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 
 // ---- idle loop -------------------------------------------------------------
 double now_time();
-void log(C *c, const char *message);
-void log(C *c, const char *format, Borrowed value);
+void log(C *c, Borrowed message);
+void log(C *c, Borrowed format, Borrowed value);
 PyObject *CB_DoIdleAnalysis(C *c); // True, False or None; NULL with an exception
 void DoScans(C *c, double end_time);
 bool CheckWholeFiles(C *c, double end_time);
@@ -201,6 +203,8 @@ void CancelIdle(C *c);
 bool QueuesEmpty(C *c, bool include_waiting);
 void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority);
 void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority);
+// One pair: an override receives [(loc, scope)], the class itself no list.
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first, Borrowed priority);
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name);
 void ClearLastScanInfo(C *c, Borrowed loc_iterable);
 Ref GetStatus(C *c);

@@ -68,8 +68,9 @@ void UpdateForHelperProcess(C *c) {
     py::check_int(PySet_Clear(f._fLocsQueuedInHelper.get()));
   }
   // 2.-3. the callback object
-  Ref support = py::getattr(f.fAnaMgr, "_fHelperProcessSupport");
-  Ref callback_obj = support.is_none() ? Ref::none() : py::getattr(support, "fHelperCallbackObj");
+  Ref support = py::getattr(f.fAnaMgr, PY_NAME("_fHelperProcessSupport"));
+  Ref callback_obj =
+      support.is_none() ? Ref::none() : py::getattr(support, PY_NAME("fHelperCallbackObj"));
   if (callback_obj.is_none() || py::eq(callback_obj, or_none(f._fHelperCallbackObjConnected)))
     return;
   // 4. hand queued whole-file primary work over
@@ -114,9 +115,9 @@ void UpdateForHelperProcess(C *c) {
   Ref removed = handler(&def_on_locs_removed, self);
   Ref added = handler(&def_on_locs_added, self);
   py::call_method(callback_obj, host::names().class_connect_while_alive,
-                  py::interned("scan-queue-locs-removed"), removed, self);
+                  PY_NAME("scan-queue-locs-removed"), removed, self);
   py::call_method(callback_obj, host::names().class_connect_while_alive,
-                  py::interned("scan-queue-locs-added"), added, self);
+                  PY_NAME("scan-queue-locs-added"), added, self);
   // 7.
   f._fHelperCallbackObjConnected = callback_obj;
 }

@@ -30,7 +30,7 @@ Ref as_text(Borrowed v) {
   return v.ref();
 }
 
-Ref first_char(Borrowed module, const char *name) {
+Ref first_char(Borrowed module, Borrowed name) {
   Ref s = as_text(py::getattr(module, name));
   return py::check(PyUnicode_Substring(s.get(), 0, 1));
 }
@@ -52,9 +52,9 @@ Ref slice(Borrowed s, Py_ssize_t start, Py_ssize_t end) {
 Ref modtimes_for(C *c, Borrowed loc_seq) {
   Ref times = py::new_dict();
   std::vector<Ref> check_disk;
-  static Ref *s_is_modified = new Ref(py::interned("IsModified"));
-  static Ref *s_last_known = new Ref(py::interned("_GetLastKnownModTime"));
-  static Ref *s_disk = new Ref(py::interned("GetDiskMTime"));
+  static Ref *s_is_modified = new Ref(PY_NAME("IsModified"));
+  static Ref *s_last_known = new Ref(PY_NAME("_GetLastKnownModTime"));
+  static Ref *s_disk = new Ref(PY_NAME("GetDiskMTime"));
   py::for_each(loc_seq, [&](Borrowed loc) {
     Ref buf = host::cachemgr::DoesCacheBufferExist(c->f.fCacheMgr, loc);
     if (buf.is_none())
@@ -84,17 +84,22 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   if (!f._fAnalyzeFoundImports)
     return;
   Ref factory = host::anamgr::AnalysisFactory(f.fAnaMgr);
+  // An empty list or tuple (a scanned file that imports nothing) yields no
+  // names: nothing of the symbol-information module is needed.
+  if ((PyList_CheckExact(imported_equivs.get()) || PyTuple_CheckExact(imported_equivs.get())) &&
+      PySequence_Fast_GET_SIZE(imported_equivs.get()) == 0)
+    return;
   Ref names = py::new_set();
   Borrowed si = host::modules->symbolinfo;
-  const Py_ssize_t prefix_len = py::as_ll(py::getattr(si, "kPrefixLen"));
-  Ref import_kind = first_char(si, "kImportKind");
-  Ref from_kind = first_char(si, "kFromImportKind");
-  Ref plain_kind = first_char(si, "kPlainEquivKind");
-  Ref split = py::getattr(si, "NonNestedSplit");
-  Ref parent_of = py::getattr(si, "ParentScopeName");
-  Ref all_dots = py::getattr(si, "AllDotsInSlice");
-  Ref semicolon = py::interned(";"), colon = py::interned(":"), space = py::interned(" "),
-      star = py::interned("*"), dot = py::interned(".");
+  const Py_ssize_t prefix_len = py::as_ll(py::getattr(si, PY_NAME("kPrefixLen")));
+  Ref import_kind = first_char(si, PY_NAME("kImportKind"));
+  Ref from_kind = first_char(si, PY_NAME("kFromImportKind"));
+  Ref plain_kind = first_char(si, PY_NAME("kPlainEquivKind"));
+  Ref split = py::getattr(si, PY_NAME("NonNestedSplit"));
+  Ref parent_of = py::getattr(si, PY_NAME("ParentScopeName"));
+  Ref all_dots = py::getattr(si, PY_NAME("AllDotsInSlice"));
+  Ref semicolon = PY_NAME(";"), colon = PY_NAME(":"), space = PY_NAME(" "), star = PY_NAME("*"),
+      dot = PY_NAME(".");
 
   py::for_each(imported_equivs, [&](Borrowed value) {
     Ref text = as_text(value);
@@ -120,7 +125,7 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
         py::set_add(names, slice(eq, prefix_len, -2));
         return;
       }
-      Ref dotted = py::interned("");
+      Ref dotted = PY_NAME("");
       if (nparts == 2 && PyUnicode_GET_LENGTH(p0.get()) && PyUnicode_GET_LENGTH(p1.get())) {
         Py_ssize_t ends = PyUnicode_Tailmatch(p0.get(), dot.get(), 0, PY_SSIZE_T_MAX, 1);
         if (ends < 0)
@@ -144,7 +149,7 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   if (PySet_GET_SIZE(names.get()) == 0)
     return;
 
-  Ref found = py::call_method(factory, py::interned("_FindPrimaryLocsForNames"), names, dirloc,
+  Ref found = py::call_method(factory, PY_NAME("_FindPrimaryLocsForNames"), names, dirloc,
                               Borrowed(Py_False));
   Ref loc_list = py::new_list();
   py::for_each(found, [&](Borrowed loc) {
@@ -154,7 +159,7 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
   Ref ready = loc_list;
   if (q->f.fAnyAsyncInspectLocation) {
     ready = py::new_list();
-    static Ref *s_is_ready = new Ref(py::interned("IsReady"));
+    static Ref *s_is_ready = new Ref(PY_NAME("IsReady"));
     for (Py_ssize_t i = 0; i < PyList_GET_SIZE(loc_list.get()); ++i) {
       Borrowed loc(PyList_GET_ITEM(loc_list.get(), i));
       if (py::truth(py::call_method(loc, *s_is_ready)))
@@ -199,7 +204,7 @@ void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Bor
 
 Ref GetModtimeDict(C *c, Borrowed loc_seq) {
   Ref times = modtimes_for(c, loc_seq);
-  host::objectmodel::emit(self_of(c), py::interned("modtimes-updated"), times);
+  host::objectmodel::emit(self_of(c), PY_NAME("modtimes-updated"), times);
   return times;
 }
 
@@ -223,7 +228,7 @@ PyObject *process_modtimes(PyObject *cell, PyObject *abort){
                  Py_RETURN_NONE;
                }
                Ref times = modtimes_for(c, loc_seq);
-               host::objectmodel::emit(self_of(c), py::interned("modtimes-updated"), times);
+               host::objectmodel::emit(self_of(c), PY_NAME("modtimes-updated"), times);
                py::call(completion_cb, times);
                Py_RETURN_NONE;
              })}
@@ -240,7 +245,7 @@ PyMethodDef def_process_modtimes = {
 void GetModtimes(C *c, Borrowed loc_seq, Borrowed completion_cb, Borrowed force) {
   Ref cell = py::check(PyTuple_Pack(3, self_of(c).get(), loc_seq.get(), completion_cb.get()));
   Ref cb = py::check(PyCFunction_NewEx(&def_process_modtimes, cell.get(), nullptr));
-  Ref wait = py::getattr(host::modules->location, "_WaitForInspectMultiple");
+  Ref wait = py::getattr(host::modules->location, PY_NAME("_WaitForInspectMultiple"));
   py::call(wait, loc_seq, cb, force);
 }
 

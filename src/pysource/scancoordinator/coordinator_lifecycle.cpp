@@ -26,7 +26,18 @@ namespace om = host::objectmodel;
 
 constexpr const char *kSignals[] = {"scheduled", "end", "scan-status-update", "modtimes-updated"};
 
-Ref signal_name(int i) { return py::interned(kSignals[i]); }
+Borrowed signal_name(int i) {
+  switch (i) {
+  case 0:
+    return PY_NAME(kSignals[0]);
+  case 1:
+    return PY_NAME(kSignals[1]);
+  case 2:
+    return PY_NAME(kSignals[2]);
+  default:
+    return PY_NAME(kSignals[3]);
+  }
+}
 
 // Handlers are plain functions, like closures over the coordinator: each is
 // bound to a one-item tuple holding it (its "cell"), not to the coordinator
@@ -131,13 +142,12 @@ Ref handler(PyMethodDef *def, Borrowed bound_to) {
   return py::check(PyCFunction_NewEx(def, cell.get(), nullptr));
 }
 
-Ref class_connect_while_alive(Borrowed cls, const char *signal, Borrowed cb, Borrowed owner) {
-  return py::call_method(cls, host::names().class_connect_while_alive, py::interned(signal), cb,
-                         owner);
+Ref class_connect_while_alive(Borrowed cls, Borrowed signal, Borrowed cb, Borrowed owner) {
+  return py::call_method(cls, host::names().class_connect_while_alive, signal, cb, owner);
 }
 
-Ref connect(Borrowed emitter, const char *signal, Borrowed cb) {
-  return py::call_method(emitter, host::names().connect, py::interned(signal), cb);
+Ref connect(Borrowed emitter, Borrowed signal, Borrowed cb) {
+  return py::call_method(emitter, host::names().connect, signal, cb);
 }
 
 } // namespace
@@ -157,13 +167,13 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   {
     Ref signals = py::check(PyTuple_New(4));
     for (int i = 0; i < 4; ++i)
-      PyTuple_SET_ITEM(signals.get(), i, signal_name(i).release());
+      PyTuple_SET_ITEM(signals.get(), i, signal_name(i).ref().release());
     om::base_init(self, signals);
   }
   // 2. collaborators
   f.fAnaMgr = ana_mgr.ref();
   {
-    Ref info_cache = py::getattr(ana_mgr, "fInfoCache");
+    Ref info_cache = py::getattr(ana_mgr, PY_NAME("fInfoCache"));
     if (!info_cache.is_none()) {
       Ref cls = host::infocache::InfoCacheClass();
       int ok = PyObject_IsInstance(info_cache.get(), cls.get());
@@ -177,17 +187,17 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
     }
     f._fInfoCache = info_cache;
   }
-  f._fInferenceEngine = py::getattr(ana_mgr, "fInferenceEngine");
-  f.fPrefMgr = py::getattr(host::gui::GetSingletons(), "fPrefMgr");
-  f.fCacheMgr = py::getattr(host::gui::GetSingletons(), "fCacheMgr");
+  f._fInferenceEngine = py::getattr(ana_mgr, PY_NAME("fInferenceEngine"));
+  f.fPrefMgr = py::getattr(host::gui::GetSingletons(), PY_NAME("fPrefMgr"));
+  f.fCacheMgr = py::getattr(host::gui::GetSingletons(), PY_NAME("fCacheMgr"));
   f.fSingletons = host::gui::GetSingletons();
   f._fIdleScanSuspendCount = 0;
   // 3. the scan queue
   {
-    Ref data_cache = py::getattr(f.fAnaMgr, "fLocationDataCache");
+    Ref data_cache = py::getattr(f.fAnaMgr, PY_NAME("fLocationDataCache"));
     f._fScanQueue =
         py::call(Borrowed(reinterpret_cast<PyObject *>(state->ScanQueueType)), data_cache);
-    Ref cb = py::getattr(self, "_CB_QueueLocationsAdded");
+    Ref cb = py::getattr(self, PY_NAME("_CB_QueueLocationsAdded"));
     om::connect_while_alive(f._fScanQueue, host::names().locations_added, cb, self);
   }
   // 4. the remaining fields
@@ -214,48 +224,52 @@ void init(C *c, Borrowed idle_priority, Borrowed ana_mgr) {
   f.fActiveScanItem = Ref::none();
   f._fScanTripleCompletedCount = py::call(state->defaultdict, state->int_type);
   f.fLog =
-      py::call(py::getattr(host::modules->fastaccess, "CLogger"), py::interned("IdleAnalysis"));
+      py::call(py::getattr(host::modules->fastaccess, PY_NAME("CLogger")), PY_NAME("IdleAnalysis"));
   f._fActiveIdleStart = -1.0;
   f._fLastLogQueue = -1.0;
   f.fWaitingForRemote = false;
   f._fIdleToWriteToDatabase = Ref::none();
   // 5. connections
   {
-    Ref mod_file_cache = py::getattr(host::anamgr::AnalysisFactory(ana_mgr), "_fModFileCache");
+    Ref mod_file_cache =
+        py::getattr(host::anamgr::AnalysisFactory(ana_mgr), PY_NAME("_fModFileCache"));
     Ref cb = host::mainloop::NoArgCallback(handler(&def_on_mod_cache_suspend, self));
-    om::connect_while_alive(mod_file_cache, py::interned("suspend"), cb, self);
+    om::connect_while_alive(mod_file_cache, PY_NAME("suspend"), cb, self);
     cb = host::mainloop::NoArgCallback(handler(&def_on_mod_cache_unsuspend, self));
-    om::connect_while_alive(mod_file_cache, py::interned("unsuspend"), cb, self);
+    om::connect_while_alive(mod_file_cache, PY_NAME("unsuspend"), cb, self);
   }
-  Ref analysis_cls = py::getattr(host::modules->analysis, "CPySourceAnalysis");
-  class_connect_while_alive(analysis_cls, "modified", handler(&def_on_modified, self), self);
+  Ref analysis_cls = py::getattr(host::modules->analysis, PY_NAME("CPySourceAnalysis"));
+  class_connect_while_alive(analysis_cls, PY_NAME("modified"), handler(&def_on_modified, self),
+                            self);
   {
-    Ref savable_mgr = py::getattr(f.fSingletons, "fSavableMgr");
+    Ref savable_mgr = py::getattr(f.fSingletons, PY_NAME("fSavableMgr"));
     Ref weak_self = py::check(PyWeakref_NewRef(self.get(), nullptr));
-    connect(savable_mgr, "external-files-changed", handler(&def_on_external_mod, weak_self));
+    connect(savable_mgr, PY_NAME("external-files-changed"),
+            handler(&def_on_external_mod, weak_self));
   }
-  class_connect_while_alive(py::getattr(host::modules->textcache, "CTextCache"), "text-modified",
-                            handler(&def_on_buffer_change, self), self);
-  class_connect_while_alive(analysis_cls, "active-edit-lineno-changed",
-                            py::getattr(self, "_CB_ActiveEditLinenoChanged"), self);
-  if (py::truth(py::getattr(host::modules->config, "kAvailRemoteSupport"))) {
-    Ref fromlist = py::check(
-        PyTuple_Pack(2, py::interned("remoteclient").get(), py::interned("containers").get()));
+  class_connect_while_alive(py::getattr(host::modules->textcache, PY_NAME("CTextCache")),
+                            PY_NAME("text-modified"), handler(&def_on_buffer_change, self), self);
+  class_connect_while_alive(analysis_cls, PY_NAME("active-edit-lineno-changed"),
+                            py::getattr(self, PY_NAME("_CB_ActiveEditLinenoChanged")), self);
+  if (py::truth(py::getattr(host::modules->config, PY_NAME("kAvailRemoteSupport")))) {
+    Ref fromlist =
+        py::check(PyTuple_Pack(2, PY_NAME("remoteclient").get(), PY_NAME("containers").get()));
     Ref pkg =
         py::check(PyImport_ImportModuleLevel("ostrelbase", nullptr, nullptr, fromlist.get(), 0));
-    Ref remoteclient = py::getattr(pkg, "remoteclient");
-    Ref containers = py::getattr(pkg, "containers");
+    Ref remoteclient = py::getattr(pkg, PY_NAME("remoteclient"));
+    Ref containers = py::getattr(pkg, PY_NAME("containers"));
     Ref cb = host::mainloop::NoArgCallback(handler(&def_on_server_changed, self));
-    class_connect_while_alive(py::getattr(remoteclient, "CRemoteServerManager"), "server-stopped",
-                              cb, self);
+    class_connect_while_alive(py::getattr(remoteclient, PY_NAME("CRemoteServerManager")),
+                              PY_NAME("server-stopped"), cb, self);
     cb = host::mainloop::NoArgCallback(handler(&def_on_server_changed, self));
-    class_connect_while_alive(py::getattr(containers, "CContainerInspectorManager"),
-                              "server-stopped", cb, self);
+    class_connect_while_alive(py::getattr(containers, PY_NAME("CContainerInspectorManager")),
+                              PY_NAME("server-stopped"), cb, self);
   }
-  connect(f._fInfoCache, "needs-scan-added", py::getattr(self, "_CB_NeedsScanAdded"));
+  connect(f._fInfoCache, PY_NAME("needs-scan-added"),
+          py::getattr(self, PY_NAME("_CB_NeedsScanAdded")));
   {
     Ref cb = host::mainloop::NoArgCallback(handler(&def_on_import_resolution_changed, self));
-    connect(host::anamgr::AnalysisFactory(f.fAnaMgr), "import-resolution-changed", cb);
+    connect(host::anamgr::AnalysisFactory(f.fAnaMgr), PY_NAME("import-resolution-changed"), cb);
   }
   // 6.
   f._fLocsQueuedInHelper = py::new_set();
@@ -290,7 +304,7 @@ void ScheduleIdle(C *c) {
     return;
   if (host::anamgr::PythonPathLength(f.fAnaMgr) == 0)
     return;
-  Ref cb = py::getattr(self_of(c), "_CB_DoIdleAnalysis");
+  Ref cb = py::getattr(self_of(c), PY_NAME("_CB_DoIdleAnalysis"));
   Ref prio = py::integer(f.fIdlePriority);
   f._fIdleProcId = host::mainloop::idle_add(cb, prio);
   om::emit(self_of(c), signal_name(0));

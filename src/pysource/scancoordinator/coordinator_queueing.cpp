@@ -76,6 +76,15 @@ void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed pri
   call::ScheduleIdle(c);
 }
 
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first,
+                             Borrowed priority) {
+  if (!host::infocache::WantDerivedInfo(c->f._fInfoCache, loc))
+    return;
+  Ref prio = resolve_priority(c, first, priority);
+  sq::AddScanPair(queue(c), loc, scope, host::anamgr::DerivedScanName(c->f.fAnaMgr), prio, false);
+  call::ScheduleIdle(c);
+}
+
 void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
   Ref primary = py::new_list(), secondary = py::new_list();
   py::for_each(needs_scan_set, [&](Borrowed triple) {
@@ -104,7 +113,7 @@ void CB_NeedsScanAdded(C *c, Borrowed, Borrowed needs_scan_added, Borrowed prior
       py::eq(item_field(item, 2), derived)) {
     Ref scanner = py::dict_get(c->f.fActiveSecondaryWholeFileScanners, item_field(item, 0));
     if (has(scanner))
-      needs = py::call_method(scanner, py::interned("FilterNeedsScan"), needs);
+      needs = py::call_method(scanner, PY_NAME("FilterNeedsScan"), needs);
   }
   Ref prio;
   if (priority && !priority.is_none())
@@ -140,7 +149,7 @@ void CB_ActiveEditLinenoChanged(C *c, Borrowed ana, Borrowed new_lineno) {
     return;
   Ref current = Ref::none();
   if (!py::eq(new_lineno, py::integer(-1)))
-    current = py::call_method(ana, py::interned("FindScopeContainingLine"), new_lineno);
+    current = py::call_method(ana, PY_NAME("FindScopeContainingLine"), new_lineno);
   Ref pairs = py::new_list();
   py::for_each(incomplete, [&](Borrowed scope) {
     int ne = PyObject_RichCompareBool(scope.get(), current.get(), Py_NE);
@@ -164,22 +173,22 @@ bool QueueBasicModules(C *c, Borrowed) {
   if (c->f._fAllBasicModuleQueued)
     return false;
   Ref factory = host::anamgr::AnalysisFactory(c->f.fAnaMgr);
-  Ref builtin = py::call_method(factory, py::interned("FindBuiltinMod"));
+  Ref builtin = py::call_method(factory, PY_NAME("FindBuiltinMod"));
   if (builtin.is_none())
     return false;
   Ref locs = py::new_list();
   {
-    Ref name = py::getattr(builtin, "fLocalName");
-    Ref found = py::call_method(factory, py::interned("GetAllLocsForName"), name, Borrowed(Py_None),
+    Ref name = py::getattr(builtin, PY_NAME("fLocalName"));
+    Ref found = py::call_method(factory, PY_NAME("GetAllLocsForName"), name, Borrowed(Py_None),
                                 Borrowed(Py_False));
     py::for_each(found, [&](Borrowed loc) { py::list_append(locs, loc); });
   }
-  Ref typing = py::call_method(factory, py::interned("GetTypingLocations"));
+  Ref typing = py::call_method(factory, PY_NAME("GetTypingLocations"));
   if (py::truth(typing))
     py::for_each(typing, [&](Borrowed loc) { py::list_append(locs, loc); });
   Ref pairs = py::new_list();
   for (Py_ssize_t i = 0; i < PyList_GET_SIZE(locs.get()); ++i)
-    py::list_append(pairs, tuple_of(Borrowed(PyList_GET_ITEM(locs.get(), i)), py::interned("*")));
+    py::list_append(pairs, tuple_of(Borrowed(PyList_GET_ITEM(locs.get(), i)), PY_NAME("*")));
   call::AddPairsToPrimaryQueue(c, pairs, Borrowed(Py_True),
                                state->priorities[kTypingModulePriority]);
   c->f._fAllBasicModuleQueued = true;
@@ -189,9 +198,9 @@ bool QueueBasicModules(C *c, Borrowed) {
 void AddParseablesToQueue(C *c, Borrowed loc_seq, Borrowed priority) {
   Ref mimes = py::new_dict();
   py::for_each(loc_seq, [&](Borrowed loc) { py::dict_set(mimes, loc, Borrowed(Py_None)); });
-  Ref attrib_mgr = py::getattr(host::gui::GetSingletons(), "fFileAttribMgr");
-  py::call_method(attrib_mgr, py::interned("GetMultipleProbableMimeTypes"), mimes);
-  Ref analysable = py::getattr(host::modules->mime, "kAnalyzableMimeTypes");
+  Ref attrib_mgr = py::getattr(host::gui::GetSingletons(), PY_NAME("fFileAttribMgr"));
+  py::call_method(attrib_mgr, PY_NAME("GetMultipleProbableMimeTypes"), mimes);
+  Ref analysable = py::getattr(host::modules->mime, PY_NAME("kAnalyzableMimeTypes"));
   Ref pairs = py::new_list();
   Py_ssize_t pos = 0;
   PyObject *k, *v;
@@ -241,14 +250,14 @@ void FlushQueue(C *c) {
     Ref id = f._fIdleProcId;
     host::mainloop::idle_remove(id);
     f._fIdleProcId = Ref::none();
-    host::objectmodel::emit(self_of(c), py::interned("end"));
+    host::objectmodel::emit(self_of(c), PY_NAME("end"));
   }
   sq::Clear(queue(c));
   PyDict_Clear(f._fLastScanCompleted.get());
   PyDict_Clear(f._fMTimeAtLastWholeFileCheck.get());
   f._fAllBasicModuleQueued = false;
   f.fWaitingForRemote = false;
-  host::cachemgr::ClearEOLBlindCacheAndScans(py::getattr(f.fSingletons, "fCacheMgr"));
+  host::cachemgr::ClearEOLBlindCacheAndScans(py::getattr(f.fSingletons, PY_NAME("fCacheMgr")));
   py::check_int(PySet_Clear(f._fLocsQueuedInHelper.get()));
   Ref proxy = host::anamgr::HelperProcessProxy(f.fAnaMgr);
   if (!proxy.is_none())
@@ -268,7 +277,7 @@ void ClearLastScanInfo(C *c, Borrowed loc_iterable) {
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name) {
   if (!py::eq(scope_name, state->kWildcardScope))
     return false;
-  Ref cls = py::getattr(host::modules->location, "CLocalFileLocation");
+  Ref cls = py::getattr(host::modules->location, PY_NAME("CLocalFileLocation"));
   int is_local = PyObject_IsInstance(loc.get(), cls.get());
   if (is_local < 0)
     py::throw_error();

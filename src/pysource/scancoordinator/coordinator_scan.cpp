@@ -31,54 +31,67 @@ constexpr const char *kFinishSecondary = "Finished secondary whole file scan: %r
 enum class Outcome { Waiting, Unfinished, Finished, Abandoned };
 
 Outcome run_slice(Borrowed scanner, double end_time) {
-  static Ref *s_scan = new Ref(py::interned("Scan"));
-  Ref end = py::floating(end_time);
-  Ref st = py::call_method(scanner, *s_scan, end);
-  if (py::eq(st, host::scanners::State("kWaitingForData")))
+  Ref end = host::Snapshot::floating(end_time);
+  Ref st = py::call_method(scanner, PY_NAME("Scan"), end);
+  if (py::eq(st, host::attr(host::Attr::kWaitingForData)))
     return Outcome::Waiting;
-  if (py::eq(st, host::scanners::State("kFinishedScanning")))
+  if (py::eq(st, host::attr(host::Attr::kFinishedScanning)))
     return Outcome::Finished;
-  if (py::eq(st, host::scanners::State("kScanAbandoned")))
+  if (py::eq(st, host::attr(host::Attr::kScanAbandoned)))
     return Outcome::Abandoned;
   return Outcome::Unfinished;
 }
 
+// d.pop(key, None): one lookup.
 void dict_discard(Borrowed d, Borrowed key) {
-  if (py::dict_contains(d, key))
-    py::dict_del(d, key);
+  Ref dropped = py::check(_PyDict_Pop(d.get(), key.get(), Py_None));
 }
 
 // self._fIncompleteScansByLoc[loc]: the location's set, created when missing.
+// The field is a defaultdict(set); while it still is exactly that, a missing
+// set is made and stored here, as its __missing__ would.
 Ref incomplete_set(C *c, Borrowed loc) {
-  return py::check(PyObject_GetItem(c->f._fIncompleteScansByLoc.get(), loc.get()));
+  Borrowed d = c->f._fIncompleteScansByLoc;
+  if (Py_TYPE(d.get()) == reinterpret_cast<PyTypeObject *>(state->defaultdict.get())) {
+    const Py_hash_t h = py::hash(loc);
+    PyObject *v = _PyDict_GetItem_KnownHash(d.get(), loc.get(), h);
+    if (v)
+      return Ref::borrow(v);
+    if (PyErr_Occurred())
+      py::throw_error();
+    Ref factory = py::getattr(d, PY_NAME("default_factory"));
+    if (factory.get() == reinterpret_cast<PyObject *>(&PySet_Type)) {
+      Ref s = py::new_set();
+      py::check_int(_PyDict_SetItem_KnownHash(d.get(), loc.get(), s.get(), h));
+      return s;
+    }
+  }
+  return py::check(PyObject_GetItem(d.get(), loc.get()));
 }
 
-Ref new_scanner(const char *cls, std::initializer_list<PyObject *> args, Borrowed incomplete,
-                Borrowed log) {
-  Ref type = host::scanners::Class(cls);
-  std::vector<PyObject *> argv(args);
-  static Ref *kw = new Ref(py::check(
-      PyTuple_Pack(2, py::interned("incomplete_scope_set").get(), py::interned("log").get())));
-  argv.push_back(incomplete.get());
-  argv.push_back(log.get());
-  return py::call_kw(type, argv.data(), args.size(), *kw);
+// cls(a, b, incomplete_scope_set=incomplete, log=log)
+Ref new_scanner(host::Attr cls, Borrowed a, Borrowed b, Borrowed incomplete, Borrowed log) {
+  Ref type = host::attr(cls);
+  static Ref *kw = new Ref(
+      py::check(PyTuple_Pack(2, PY_NAME("incomplete_scope_set").get(), PY_NAME("log").get())));
+  PyObject *argv[] = {a.get(), b.get(), incomplete.get(), log.get()};
+  return py::call_kw(type, argv, 2, *kw);
 }
 
 } // namespace
 
 bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
-  Ref ana_mgr = py::getattr(f.fSingletons, "fAnalysisMgr");
-  Ref loc = item_field(scan_item, 0), scan_name = item_field(scan_item, 2),
-      priority = item_field(scan_item, 3);
+  Ref ana_mgr = py::getattr(f.fSingletons, PY_NAME("fAnalysisMgr"));
+  const ItemFields fields(scan_item, 0b1101);
+  const Borrowed loc = fields[0], scan_name = fields[2], priority = fields[3];
   Ref active = f.fActivePrimaryWholeFileScanners;
   Ref scanner = py::dict_get(active, loc);
   if (!scanner) {
     Ref incomplete = incomplete_set(c, loc);
-    scanner =
-        new_scanner("CWholeFilePrimaryScanner", {loc.get(), scan_name.get()}, incomplete, f.fLog);
+    scanner = new_scanner(host::Attr::CWholeFilePrimaryScanner, loc, scan_name, incomplete, f.fLog);
     py::dict_set(active, loc, scanner);
-    log(c, msgs::kStartWhole, loc);
+    log(c, PY_NAME(msgs::kStartWhole), loc);
   }
   const Outcome out = run_slice(scanner, end_time);
   if (out == Outcome::Waiting) {
@@ -87,31 +100,33 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   }
   if (out == Outcome::Unfinished)
     return true;
-  log(c, msgs::kFinishWhole, loc);
+  log(c, PY_NAME(msgs::kFinishWhole), loc);
   dict_discard(active, loc);
   host::objectmodel::destroy(scanner);
   if (out == Outcome::Abandoned)
     return false;
 
   Ref incomplete = py::dict_get(f._fIncompleteScansByLoc, loc);
-  if (incomplete && PyObject_Size(incomplete.get()) == 0)
-    dict_discard(f._fIncompleteScansByLoc, loc);
-  if (PyErr_Occurred())
-    py::throw_error();
+  if (incomplete) {
+    const Py_ssize_t n = PyObject_Size(incomplete.get());
+    if (n < 0)
+      py::throw_error();
+    if (n == 0)
+      dict_discard(f._fIncompleteScansByLoc, loc);
+  }
 
   Ref locs = py::check(PyList_New(1));
   PyList_SET_ITEM(locs.get(), 0, Ref(loc).release());
   Ref imported = py::new_list();
-  py::for_each(py::call_method(f._fInfoCache, py::interned("GetAllImports"), locs),
-               [&](Borrowed rec) {
-                 Ref last = py::check(PySequence_GetItem(rec.get(), -1));
-                 py::list_append(imported, last);
-               });
-  Ref dirloc = py::call_method(loc, py::interned("GetParentDir"));
+  py::for_each(py::call_method(f._fInfoCache, PY_NAME("GetAllImports"), locs), [&](Borrowed rec) {
+    Ref last = py::check(PySequence_GetItem(rec.get(), -1));
+    py::list_append(imported, last);
+  });
+  Ref dirloc = py::call_method(loc, PY_NAME("GetParentDir"));
   call::AddImportEquivsToQueue(c, imported, dirloc, priority);
 
   Ref factory = host::anamgr::AnalysisFactory(ana_mgr);
-  Ref sec = py::call_method(factory, py::interned("GetSecondaryLocations"), loc);
+  Ref sec = py::call_method(factory, PY_NAME("GetSecondaryLocations"), loc);
   if (py::truth(sec)) {
     Ref pairs = py::new_list();
     py::for_each(sec, [&](Borrowed l) {
@@ -119,17 +134,16 @@ bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
     });
     call::AddPairsToPrimaryQueue(c, pairs, Borrowed(Py_True), priority);
   }
-  call::AddPairsToSecondaryQueue(c, one_pair_list(loc, state->kWildcardScope), Borrowed(Py_True),
-                                 priority);
+  call::AddPairToSecondaryQueue(c, loc, state->kWildcardScope, Borrowed(Py_True), priority);
   return false;
 }
 
 bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
-  Ref loc = item_field(scan_item, 0), scope = item_field(scan_item, 1),
-      priority = item_field(scan_item, 3);
+  const ItemFields fields(scan_item, 0b1011);
+  const Borrowed loc = fields[0], scope = fields[1], priority = fields[3];
   Ref symbolinfo = host::modules->symbolinfo;
-  if (py::truth(py::call(py::getattr(symbolinfo, "IsInstanceScope"), scope))) {
+  if (py::truth(py::call(py::getattr(symbolinfo, PY_NAME("IsInstanceScope")), scope))) {
     call::BuildInstanceScopeNoScanning(c, loc, scope, end_time);
     return false;
   }
@@ -139,12 +153,11 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   if (!scanner) {
     Ref ana = call::GetAnalysis(c, loc, false);
     if (has(ana))
-      py::call_method(ana, py::interned("UpdateFromCache"));
+      py::call_method(ana, PY_NAME("UpdateFromCache"));
     Ref incomplete = incomplete_set(c, loc);
-    scanner =
-        new_scanner("CSingleScopePrimaryScanner", {loc.get(), scope.get()}, incomplete, f.fLog);
+    scanner = new_scanner(host::Attr::CSingleScopePrimaryScanner, loc, scope, incomplete, f.fLog);
     py::dict_set(active, key, scanner);
-    py::call(f.fLog, py::interned(msgs::kStartScope), scope, loc);
+    py::call(f.fLog, PY_NAME(msgs::kStartScope), scope, loc);
   }
   const Outcome out = run_slice(scanner, end_time);
   if (out == Outcome::Waiting) {
@@ -154,20 +167,20 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   if (out == Outcome::Unfinished)
     return true;
   dict_discard(active, key);
-  Ref changed = py::call_method(scanner, py::interned("SaveToInfoCache"), py::Borrowed(Py_False));
-  py::call(f.fLog, py::interned(msgs::kFinishScope), scope, loc, changed);
+  Ref changed = py::call_method(scanner, PY_NAME("SaveToInfoCache"), py::Borrowed(Py_False));
+  py::call(f.fLog, PY_NAME(msgs::kFinishScope), scope, loc, changed);
   if (!py::truth(changed)) {
     host::objectmodel::destroy(scanner);
     return false;
   }
   // Import equivalents of the new information.
   Ref imported = py::new_list();
-  Ref info = py::getattr(scanner, "fInfo");
+  Ref info = py::getattr(scanner, PY_NAME("fInfo"));
   if (!info.is_none()) {
-    Ref import_prefix = py::getattr(symbolinfo, "kImportPrefix");
-    Ref from_prefix = py::getattr(symbolinfo, "kFromImportPrefix");
-    Ref split = py::getattr(symbolinfo, "NonNestedSplit");
-    Ref values = py::call_method(py::getattr(info, "type_equivs"), py::interned("values"));
+    Ref import_prefix = py::getattr(symbolinfo, PY_NAME("kImportPrefix"));
+    Ref from_prefix = py::getattr(symbolinfo, PY_NAME("kFromImportPrefix"));
+    Ref split = py::getattr(symbolinfo, PY_NAME("NonNestedSplit"));
+    Ref values = py::call_method(py::getattr(info, PY_NAME("type_equivs")), PY_NAME("values"));
     py::for_each(values, [&](Borrowed value) {
       py::for_each(py::call(split, value, like(value, ";")), [&](Borrowed part) {
         if (starts_with(part, import_prefix) || starts_with(part, from_prefix))
@@ -176,20 +189,19 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
     });
   }
   if (PyList_GET_SIZE(imported.get()) != 0) {
-    Ref dirloc = py::call_method(loc, py::interned("GetParentDir"));
+    Ref dirloc = py::call_method(loc, PY_NAME("GetParentDir"));
     call::AddImportEquivsToQueue(c, imported, dirloc, priority);
   }
-  call::AddPairsToSecondaryQueue(c, one_pair_list(loc, scope), Borrowed(Py_False),
-                                 Borrowed(Py_None));
-  Ref scope_def = py::getattr(scanner, "fScopeDef");
+  call::AddPairToSecondaryQueue(c, loc, scope, Borrowed(Py_False), Borrowed(Py_None));
+  Ref scope_def = py::getattr(scanner, PY_NAME("fScopeDef"));
   if (!scope_def.is_none()) {
     Ref inst = Ref::none();
-    Ref get_inst = py::getattr(symbolinfo, "GetInstanceNameForClass");
-    Ref class_def = py::getattr(host::modules->logicalline, "kClassDef");
-    if (py::eq(py::getattr(scope_def, "fType"), class_def)) {
+    Ref get_inst = py::getattr(symbolinfo, PY_NAME("GetInstanceNameForClass"));
+    Ref class_def = py::getattr(host::modules->logicalline, PY_NAME("kClassDef"));
+    if (py::eq(py::getattr(scope_def, PY_NAME("fType")), class_def)) {
       inst = py::call(get_inst, scope);
-    } else if (!py::getattr(scanner, "fContainingClassDef").is_none()) {
-      Ref parent = py::call(py::getattr(symbolinfo, "ParentScopeName"), scope);
+    } else if (!py::getattr(scanner, PY_NAME("fContainingClassDef")).is_none()) {
+      Ref parent = py::call(py::getattr(symbolinfo, PY_NAME("ParentScopeName")), scope);
       inst = py::call(get_inst, parent);
     }
     if (!inst.is_none())
@@ -202,10 +214,11 @@ bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
 
 bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   auto &f = c->f;
-  Ref loc = item_field(scan_item, 0), scan_name = item_field(scan_item, 2);
+  const ItemFields fields(scan_item, 0b0101);
+  const Borrowed loc = fields[0], scan_name = fields[2];
   if (!host::infocache::WantDerivedInfo(f._fInfoCache, loc))
     return false;
-  Ref base = host::scanners::Class("CScanner");
+  Ref base = host::attr(host::Attr::CScanner);
   auto require_scanner = [&](const Ref &s) {
     int ok = PyObject_IsInstance(s.get(), base.get());
     if (ok < 0)
@@ -220,15 +233,15 @@ bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   if (scanner && !scanner.is_none()) {
     require_scanner(scanner);
   } else {
-    scanner = py::call(host::scanners::Class("CWholeFileSecondaryScanner"), loc, scan_name, f.fLog);
+    scanner = py::call(host::attr(host::Attr::CWholeFileSecondaryScanner), loc, scan_name, f.fLog);
     require_scanner(scanner);
     py::dict_set(active, loc, scanner);
-    log(c, msgs::kStartSecondary, loc);
+    log(c, PY_NAME(msgs::kStartSecondary), loc);
   }
   const Outcome out = run_slice(scanner, end_time);
   if (out != Outcome::Finished && out != Outcome::Abandoned)
     return true;
-  log(c, msgs::kFinishSecondary, loc);
+  log(c, PY_NAME(msgs::kFinishSecondary), loc);
   dict_discard(active, loc);
   host::objectmodel::destroy(scanner);
   return false;
@@ -238,14 +251,14 @@ bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double 
   auto &f = c->f;
   if (!host::infocache::WantDerivedInfo(f._fInfoCache, loc))
     return false;
-  Ref info = py::call_method(f._fInfoCache, py::interned("GetScopeInfo"), loc, scope_name);
+  Ref info = py::call_method(f._fInfoCache, PY_NAME("GetScopeInfo"), loc, scope_name);
   if (info.is_none())
     return false;
   Ref key = py::check(PyTuple_Pack(2, loc.get(), scope_name.get()));
   Ref active = f.fActiveSecondarySingleScopeScanners;
   Ref scanner = py::dict_get(active, key);
   if (!scanner) {
-    scanner = py::call(host::scanners::Class("CSingleScopeSecondaryScanner"), info, f.fLog,
+    scanner = py::call(host::attr(host::Attr::CSingleScopeSecondaryScanner), info, f.fLog,
                        Borrowed(Py_None), f.fAnaMgr);
     py::dict_set(active, key, scanner);
   }
@@ -289,7 +302,7 @@ void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item) {
   PyList_SET_ITEM(holder.get(), 0, Ref::none().release());
   Ref cell = py::check(PyTuple_Pack(3, self_of(c).get(), scan_item.get(), holder.get()));
   Ref cb = py::check(PyCFunction_NewEx(&def_cb_state_change, cell.get(), nullptr));
-  Ref id = host::objectmodel::connect_while_alive(scanner, py::interned("scan-state-changed"), cb,
+  Ref id = host::objectmodel::connect_while_alive(scanner, PY_NAME("scan-state-changed"), cb,
                                                   self_of(c));
   py::check_int(PyList_SetItem(holder.get(), 0, id.release()));
 }

@@ -38,13 +38,13 @@ void EnsureStatusTimeout(C *c) {
     return;
   if (c->f.fStatusTimeout && !c->f.fStatusTimeout.is_none())
     return;
-  Ref cb = py::getattr(self_of(c), "_CB_UpdateStatus");
+  Ref cb = py::getattr(self_of(c), PY_NAME("_CB_UpdateStatus"));
   c->f.fStatusTimeout = host::mainloop::timeout_add_while_alive(1000, cb, self_of(c));
 }
 
 bool CB_UpdateStatus(C *c) {
   Ref status = call::GetStatus(c);
-  host::objectmodel::emit(self_of(c), py::interned("scan-status-update"), self_of(c), status);
+  host::objectmodel::emit(self_of(c), PY_NAME("scan-status-update"), self_of(c), status);
   if (call::QueuesEmpty(c, false)) {
     c->f.fStatusTimeout = Ref::none();
     return false;
@@ -55,14 +55,14 @@ bool CB_UpdateStatus(C *c) {
 void ScheduleWriteToDatabaseIdle(C *c) {
   if (c->f._fIdleToWriteToDatabase && !c->f._fIdleToWriteToDatabase.is_none())
     return;
-  Ref cb = py::getattr(self_of(c), "_CB_WriteToDatabase");
+  Ref cb = py::getattr(self_of(c), PY_NAME("_CB_WriteToDatabase"));
   c->f._fIdleToWriteToDatabase = host::mainloop::idle_add_while_alive(cb, self_of(c));
 }
 
 void CB_WriteToDatabase(C *c) {
   c->f._fIdleToWriteToDatabase = Ref::none();
-  Ref info_cache = py::getattr(c->f.fAnaMgr, "fInfoCache");
-  py::call_method(info_cache, py::interned("WriteToDatabase"));
+  Ref info_cache = py::getattr(c->f.fAnaMgr, PY_NAME("fInfoCache"));
+  py::call_method(info_cache, PY_NAME("WriteToDatabase"));
 }
 
 } // namespace scancoord::co

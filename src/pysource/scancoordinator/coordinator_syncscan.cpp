@@ -54,7 +54,7 @@ template <typename F> [[noreturn]] void rethrow_after(F &&cleanup) {
 }
 
 double time_time() {
-  Ref t = py::call(py::getattr(host::modules->time, "time"));
+  Ref t = py::call(py::getattr(host::modules->time, PY_NAME("time")));
   double v = PyFloat_AsDouble(t.get());
   if (v == -1.0 && PyErr_Occurred())
     py::throw_error();
@@ -65,11 +65,12 @@ double time_time() {
 // or an empty Ref.
 Ref find_method_def(Borrowed infos) {
   Borrowed si = host::modules->symbolinfo;
-  Ref method = py::getattr(si, "kMethodPrefix"), unbound = py::getattr(si, "kUnboundMethodPrefix");
+  Ref method = py::getattr(si, PY_NAME("kMethodPrefix")),
+      unbound = py::getattr(si, PY_NAME("kUnboundMethodPrefix"));
   Ref prefixes = py::check(PyTuple_Pack(2, method.get(), unbound.get()));
-  if (!py::truth(py::call(py::getattr(si, "InfoContains"), infos, prefixes)))
+  if (!py::truth(py::call(py::getattr(si, PY_NAME("InfoContains")), infos, prefixes)))
     return Ref();
-  Ref parts = py::call(py::getattr(si, "NonNestedSplit"), infos, like(infos, ";"));
+  Ref parts = py::call(py::getattr(si, PY_NAME("NonNestedSplit")), infos, like(infos, ";"));
   Ref found;
   py::for_each(parts, [&](Borrowed part) {
     if (found || !(starts_with(part, method) || starts_with(part, unbound)))
@@ -78,7 +79,7 @@ Ref find_method_def(Borrowed infos) {
       PyErr_Format(PyExc_TypeError, msg::kExpectedType, "bytes", Py_TYPE(part.get())->tp_name);
       py::throw_error();
     }
-    found = py::call(py::getattr(si, "UnpackDefInfoStr"), part);
+    found = py::call(py::getattr(si, PY_NAME("UnpackDefInfoStr")), part);
   });
   return found;
 }
@@ -95,7 +96,7 @@ std::vector<std::pair<Ref, Ref>> items_of(Borrowed mapping) {
 }
 
 Ref primary_name_from_singletons() {
-  Ref mgr = py::getattr(host::gui::GetSingletons(), "fAnalysisMgr");
+  Ref mgr = py::getattr(host::gui::GetSingletons(), PY_NAME("fAnalysisMgr"));
   return host::anamgr::PrimaryScanName(mgr);
 }
 
@@ -118,8 +119,7 @@ bool TryToScanDictNow(C *c, Borrowed, Borrowed, Borrowed needs_scan_set, double 
     if (py::eq(parts[2], primary))
       primary_list.push_back(triple);
     else if (!py::set_contains(pending, triple))
-      call::AddPairsToSecondaryQueue(c, one_pair_list(parts[0], parts[1]), Borrowed(Py_True),
-                                     Borrowed(Py_None));
+      call::AddPairToSecondaryQueue(c, parts[0], parts[1], Borrowed(Py_True), Borrowed(Py_None));
   });
   if (primary_list.empty())
     return false;
@@ -177,7 +177,7 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
                  Borrowed) {
   auto &f = c->f;
   Borrowed si = host::modules->symbolinfo;
-  if (py::truth(py::call(py::getattr(si, "IsInstanceScope"), scope_name)))
+  if (py::truth(py::call(py::getattr(si, PY_NAME("IsInstanceScope")), scope_name)))
     return call::TryToScanInstanceScopeNow(c, loc, scope_name, end_time);
   Ref primary = host::anamgr::PrimaryScanName(f.fAnaMgr);
   Ref derived = host::anamgr::DerivedScanName(f.fAnaMgr);
@@ -196,26 +196,26 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
 
   if (do_primary) {
     Ref incomplete = py::check(PyObject_GetItem(f._fIncompleteScansByLoc.get(), loc.get()));
-    static Ref *kw = new Ref(py::check(
-        PyTuple_Pack(2, py::interned("incomplete_scope_set").get(), py::interned("log").get())));
+    static Ref *kw = new Ref(
+        py::check(PyTuple_Pack(2, PY_NAME("incomplete_scope_set").get(), PY_NAME("log").get())));
     PyObject *argv[] = {loc.get(), scope_name.get(), incomplete.get(), f.fLog.get()};
-    Ref scanner = py::call_kw(host::scanners::Class("CSingleScopePrimaryScanner"), argv, 2, *kw);
+    Ref scanner = py::call_kw(host::attr(host::Attr::CSingleScopePrimaryScanner), argv, 2, *kw);
     Ref result;
     try {
-      Ref st = py::call_method(scanner, py::interned("Scan"), py::floating(end_time));
-      if (py::truth(py::getattr(scanner, "fFileDoesntExist"))) {
+      Ref st = py::call_method(scanner, PY_NAME("Scan"), py::floating(end_time));
+      if (py::truth(py::getattr(scanner, PY_NAME("fFileDoesntExist")))) {
         sq::RemoveScanTriple(queue(c), loc, scope_name, primary, Borrowed(), true, Borrowed());
         result = state->not_found_result;
       } else {
-        const bool finished = st.get() == host::scanners::State("kFinishedScanning").get() ||
-                              st.get() == host::scanners::State("kScanAbandoned").get();
+        const bool finished = st.get() == host::attr(host::Attr::kFinishedScanning).get() ||
+                              st.get() == host::attr(host::Attr::kScanAbandoned).get();
         if (!finished)
           call::AddPairsToPrimaryQueue(c, one_pair_list(loc, scope_name), Borrowed(Py_True),
                                        Borrowed(Py_None));
-        if (st.get() == host::scanners::State("kWaitingForData").get()) {
+        if (st.get() == host::attr(host::Attr::kWaitingForData).get()) {
           result = state->waiting_result;
         } else {
-          py::call_method(scanner, py::interned("SaveToInfoCache"));
+          py::call_method(scanner, PY_NAME("SaveToInfoCache"));
           // An unfinished scan stays queued so the idle loop completes it.
           if (finished)
             sq::RemoveScanTriple(queue(c), loc, scope_name, primary, Borrowed(), true, Borrowed());
@@ -239,24 +239,23 @@ Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_lis
 Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
   auto &f = c->f;
   Borrowed si = host::modules->symbolinfo;
-  if (state->debug && !py::truth(py::call(py::getattr(si, "IsInstanceScope"), scope_name)))
+  if (state->debug && !py::truth(py::call(py::getattr(si, PY_NAME("IsInstanceScope")), scope_name)))
     assertion_failed();
-  Ref class_name = py::call(py::getattr(si, "GetClassForInstanceName"), scope_name);
-  Ref ctx =
-      py::call_method(f._fInferenceEngine, py::interned("NewContext"), py::floating(end_time));
-  static Ref *s_get = new Ref(py::interned("GetScopeInfo"));
-  static Ref *s_out = new Ref(py::interned("OutOfTime"));
+  Ref class_name = py::call(py::getattr(si, PY_NAME("GetClassForInstanceName")), scope_name);
+  Ref ctx = py::call_method(f._fInferenceEngine, PY_NAME("NewContext"), py::floating(end_time));
+  static Ref *s_get = new Ref(PY_NAME("GetScopeInfo"));
+  static Ref *s_out = new Ref(PY_NAME("OutOfTime"));
   Ref class_info = py::call_method(f._fInferenceEngine, *s_get, loc, class_name, ctx);
   if (class_info.is_none() || py::truth(py::call_method(ctx, *s_out)))
     return Ref::none();
   bool complete = true;
   Ref methods = py::new_list();
-  for (auto &kv : items_of(py::getattr(class_info, "type_equivs"))) {
+  for (auto &kv : items_of(py::getattr(class_info, PY_NAME("type_equivs")))) {
     Ref def = find_method_def(kv.second);
     if (!def)
       continue;
-    Ref info =
-        py::call_method(f._fInferenceEngine, *s_get, loc, py::getattr(def, "scope_name"), ctx);
+    Ref info = py::call_method(f._fInferenceEngine, *s_get, loc,
+                               py::getattr(def, PY_NAME("scope_name")), ctx);
     if (!info.is_none())
       py::list_append(methods, info);
     if (py::truth(py::call_method(ctx, *s_out))) {
@@ -265,9 +264,10 @@ Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double en
     }
   }
   Ref primary = primary_name_from_singletons();
-  Ref inst = py::call(host::scanners::Class("CreateClassInstInfo"), class_info, methods, primary);
+  Ref inst =
+      py::call(host::scanners::Class(PY_NAME("CreateClassInstInfo")), class_info, methods, primary);
   if (complete) {
-    py::call_method(f._fInfoCache, py::interned("AddScopeInfo"), inst);
+    py::call_method(f._fInfoCache, PY_NAME("AddScopeInfo"), inst);
     Ref stored = py::call_method(f._fInfoCache, *s_get, loc, scope_name);
     if (!stored.is_none())
       return stored;
@@ -278,15 +278,15 @@ Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double en
 Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double) {
   auto &f = c->f;
   Borrowed si = host::modules->symbolinfo;
-  if (state->debug && !py::truth(py::call(py::getattr(si, "IsInstanceScope"), scope_name)))
+  if (state->debug && !py::truth(py::call(py::getattr(si, PY_NAME("IsInstanceScope")), scope_name)))
     assertion_failed();
   Ref info_cache = f._fInfoCache;
-  static Ref *s_get = new Ref(py::interned("GetScopeInfo"));
-  static Ref *s_add = new Ref(py::interned("AddScopeInfo"));
-  Ref class_name = py::call(py::getattr(si, "GetClassForInstanceName"), scope_name);
+  static Ref *s_get = new Ref(PY_NAME("GetScopeInfo"));
+  static Ref *s_add = new Ref(PY_NAME("AddScopeInfo"));
+  Ref class_name = py::call(py::getattr(si, PY_NAME("GetClassForInstanceName")), scope_name);
   Ref class_info = py::call_method(info_cache, *s_get, loc, class_name);
   if (class_info.is_none()) {
-    Ref pl = py::call(py::getattr(si, "ParentAndLeafScopeNames"), class_name);
+    Ref pl = py::call(py::getattr(si, PY_NAME("ParentAndLeafScopeNames")), class_name);
     Ref parts[2];
     unpack(pl, 2, parts);
     Ref parent_info = py::call_method(info_cache, *s_get, loc, parts[0]);
@@ -295,27 +295,29 @@ Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double
                                    Borrowed(Py_None));
       return Ref::none();
     }
-    Ref split = py::call(py::getattr(si, "SplitScopeNameFromSuffixes"), parts[1]);
+    Ref split = py::call(py::getattr(si, PY_NAME("SplitScopeNameFromSuffixes")), parts[1]);
     Ref leaf = py::check(PySequence_GetItem(split.get(), 0));
-    Ref entry = py::call_method(py::getattr(parent_info, "type_equivs"), host::names().get, leaf);
+    Ref entry =
+        py::call_method(py::getattr(parent_info, PY_NAME("type_equivs")), host::names().get, leaf);
     const bool exists =
-        !entry.is_none() && py::truth(py::call(py::getattr(si, "InfoContains"), entry,
-                                               py::getattr(si, "kClassPrefix")));
+        !entry.is_none() && py::truth(py::call(py::getattr(si, PY_NAME("InfoContains")), entry,
+                                               py::getattr(si, PY_NAME("kClassPrefix"))));
     if (!exists) {
       Ref primary = host::anamgr::PrimaryScanName(f.fAnaMgr);
-      Ref mtime = py::getattr(parent_info, "disk_mtime");
+      Ref mtime = py::getattr(parent_info, PY_NAME("disk_mtime"));
       Borrowed scopeinfo = host::modules->scopeinfo;
-      static Ref *kw = new Ref(py::check(PyTuple_Pack(1, py::interned("does_not_exist").get())));
+      static Ref *kw = new Ref(py::check(PyTuple_Pack(1, PY_NAME("does_not_exist").get())));
       auto make = [&](Borrowed name) {
-        Ref key = py::call(py::getattr(scopeinfo, "CScopeInfoKey"), loc, name, primary, loc, name);
-        Ref empty = py::interned("");
+        Ref key = py::call(py::getattr(scopeinfo, PY_NAME("CScopeInfoKey")), loc, name, primary,
+                           loc, name);
+        Ref empty = PY_NAME("");
         PyObject *argv[] = {key.get(), empty.get(), mtime.get(), Py_False, Py_True};
-        Ref info = py::call_kw(py::getattr(scopeinfo, "CScopeInfo"), argv, 4, *kw);
+        Ref info = py::call_kw(py::getattr(scopeinfo, PY_NAME("CScopeInfo")), argv, 4, *kw);
         py::call_method(info_cache, *s_add, info);
         return info;
       };
       make(class_name);
-      Ref inst_name = py::call(py::getattr(si, "GetInstanceNameForClass"), class_name);
+      Ref inst_name = py::call(py::getattr(si, PY_NAME("GetInstanceNameForClass")), class_name);
       return make(inst_name);
     }
     call::AddPairsToPrimaryQueue(c, one_pair_list(loc, class_name), Borrowed(Py_True),
@@ -323,11 +325,11 @@ Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double
     return Ref::none();
   }
   Ref missing = py::new_list(), methods = py::new_list();
-  for (auto &kv : items_of(py::getattr(class_info, "type_equivs"))) {
+  for (auto &kv : items_of(py::getattr(class_info, PY_NAME("type_equivs")))) {
     Ref def = find_method_def(kv.second);
     if (!def)
       continue;
-    Ref name = py::getattr(def, "scope_name");
+    Ref name = py::getattr(def, PY_NAME("scope_name"));
     Ref info = py::call_method(info_cache, *s_get, loc, name);
     if (info.is_none())
       py::list_append(missing, py::check(PyTuple_Pack(2, loc.get(), name.get())));
@@ -339,7 +341,8 @@ Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double
     return Ref::none();
   }
   Ref primary = primary_name_from_singletons();
-  Ref inst = py::call(host::scanners::Class("CreateClassInstInfo"), class_info, methods, primary);
+  Ref inst =
+      py::call(host::scanners::Class(PY_NAME("CreateClassInstInfo")), class_info, methods, primary);
   py::call_method(info_cache, *s_add, inst);
   return inst;
 }

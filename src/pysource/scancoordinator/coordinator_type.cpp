@@ -407,7 +407,7 @@ PyType_Spec spec = {"pysource.scancoordinator.CScanCoordinator", sizeof(Obj), 0,
 
 // ---- dispatch ------------------------------------------------------------
 
-bool own(C *c, const char *name, FastMethod fn, py::Ref &override_out) {
+bool own(C *c, py::Borrowed name, FastMethod fn, py::Ref &override_out) {
   return own_method(reinterpret_cast<PyObject *>(c), state->CoordinatorType, name, fn,
                     override_out);
 }
@@ -418,164 +418,177 @@ namespace co::call {
 
 void ScheduleIdle(C *c) {
   py::Ref ov;
-  if (own(c, "_ScheduleIdle", m__ScheduleIdle, ov))
+  if (own(c, PY_NAME("_ScheduleIdle"), m__ScheduleIdle, ov))
     return co::ScheduleIdle(c);
   py::call(ov);
 }
 void CancelIdle(C *c) {
   py::Ref ov;
-  if (own(c, "_CancelIdle", m__CancelIdle, ov))
+  if (own(c, PY_NAME("_CancelIdle"), m__CancelIdle, ov))
     return co::CancelIdle(c);
   py::call(ov);
 }
 bool QueuesEmpty(C *c, bool include_waiting) {
   py::Ref ov;
-  if (own(c, "QueuesEmpty", m_QueuesEmpty, ov))
+  if (own(c, PY_NAME("QueuesEmpty"), m_QueuesEmpty, ov))
     return co::QueuesEmpty(c, include_waiting);
   return py::truth(py::call(ov, py::Borrowed(include_waiting ? Py_True : Py_False)));
 }
 void AddPairsToPrimaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority) {
   py::Ref ov;
-  if (own(c, "AddPairsToPrimaryQueue", m_AddPairsToPrimaryQueue, ov))
+  if (own(c, PY_NAME("AddPairsToPrimaryQueue"), m_AddPairsToPrimaryQueue, ov))
     return co::AddPairsToPrimaryQueue(c, pairs, first, priority);
-  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, py::interned("priority").get())));
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, PY_NAME("priority").get())));
   PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
   py::call_kw(ov, argv, 2, *kw);
 }
 void AddPairsToSecondaryQueue(C *c, Borrowed pairs, Borrowed first, Borrowed priority) {
   py::Ref ov;
-  if (own(c, "AddPairsToSecondaryQueue", m_AddPairsToSecondaryQueue, ov))
+  if (own(c, PY_NAME("AddPairsToSecondaryQueue"), m_AddPairsToSecondaryQueue, ov))
     return co::AddPairsToSecondaryQueue(c, pairs, first, priority);
-  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, py::interned("priority").get())));
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, PY_NAME("priority").get())));
+  PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
+  py::call_kw(ov, argv, 2, *kw);
+}
+void AddPairToSecondaryQueue(C *c, Borrowed loc, Borrowed scope, Borrowed first,
+                             Borrowed priority) {
+  py::Ref ov;
+  if (own(c, PY_NAME("AddPairsToSecondaryQueue"), m_AddPairsToSecondaryQueue, ov))
+    return co::AddPairToSecondaryQueue(c, loc, scope, first, priority);
+  static py::Ref *kw = new py::Ref(py::check(PyTuple_Pack(1, PY_NAME("priority").get())));
+  py::Ref pairs = one_pair_list(loc, scope);
   PyObject *argv[] = {pairs.get(), first.get(), priority.get()};
   py::call_kw(ov, argv, 2, *kw);
 }
 bool CanSendToHelperProcess(C *c, Borrowed loc, Borrowed scope_name) {
   py::Ref ov;
-  if (own(c, "_CanSendToHelperProcess", m__CanSendToHelperProcess, ov))
+  if (own(c, PY_NAME("_CanSendToHelperProcess"), m__CanSendToHelperProcess, ov))
     return co::CanSendToHelperProcess(c, loc, scope_name);
   return py::truth(py::call(ov, loc, scope_name));
 }
 void ClearLastScanInfo(C *c, Borrowed loc_iterable) {
   py::Ref ov;
-  if (own(c, "ClearLastScanInfo", m_ClearLastScanInfo, ov))
+  if (own(c, PY_NAME("ClearLastScanInfo"), m_ClearLastScanInfo, ov))
     return co::ClearLastScanInfo(c, loc_iterable);
   py::call(ov, loc_iterable);
 }
 
 py::Ref GetStatus(C *c) {
   py::Ref ov;
-  if (own(c, "GetStatus", m_GetStatus, ov))
+  if (own(c, PY_NAME("GetStatus"), m_GetStatus, ov))
     return co::GetStatus(c);
   return py::call(ov);
 }
 
 void EnsureStatusTimeout(C *c) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__EnsureStatusTimeout", m___EnsureStatusTimeout, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__EnsureStatusTimeout"), m___EnsureStatusTimeout, ov))
     return co::EnsureStatusTimeout(c);
   py::call(ov);
 }
 void ScheduleWriteToDatabaseIdle(C *c) {
   py::Ref ov;
-  if (own(c, "_ScheduleWriteToDatabaseIdle", m__ScheduleWriteToDatabaseIdle, ov))
+  if (own(c, PY_NAME("_ScheduleWriteToDatabaseIdle"), m__ScheduleWriteToDatabaseIdle, ov))
     return co::ScheduleWriteToDatabaseIdle(c);
   py::call(ov);
 }
 bool QueueBasicModules(C *c, Borrowed end_time) {
   py::Ref ov;
-  if (own(c, "_QueueBasicModules", m__QueueBasicModules, ov))
+  if (own(c, PY_NAME("_QueueBasicModules"), m__QueueBasicModules, ov))
     return co::QueueBasicModules(c, end_time);
   return py::truth(py::call(ov, end_time));
 }
 void DoScans(C *c, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoScans", m___DoScans, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__DoScans"), m___DoScans, ov))
     return co::DoScans(c, end_time);
   py::call(ov, py::floating(end_time));
 }
 bool CheckWholeFiles(C *c, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__CheckWholeFiles", m___CheckWholeFiles, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__CheckWholeFiles"), m___CheckWholeFiles, ov))
     return co::CheckWholeFiles(c, end_time);
   return py::truth(py::call(ov, py::floating(end_time)));
 }
 bool DoSingleScan(C *c, Borrowed scan_item, double end_time) {
   py::Ref ov;
-  if (own(c, "_DoSingleScan", m__DoSingleScan, ov))
+  if (own(c, PY_NAME("_DoSingleScan"), m__DoSingleScan, ov))
     return co::DoSingleScan(c, scan_item, end_time);
   return py::truth(py::call(ov, scan_item, py::floating(end_time)));
 }
 py::Ref GetAnalysis(C *c, Borrowed loc, bool create) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__GetAnalysis", m___GetAnalysis, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__GetAnalysis"), m___GetAnalysis, ov))
     return co::GetAnalysis(c, loc, create);
   return py::call(ov, loc, py::Borrowed(create ? Py_True : Py_False));
 }
 py::Ref GetModtimeDict(C *c, Borrowed loc_seq) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__GetModtimeDict", m___GetModtimeDict, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__GetModtimeDict"), m___GetModtimeDict, ov))
     return co::GetModtimeDict(c, loc_seq);
   return py::call(ov, loc_seq);
 }
 bool DoPrimaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoPrimaryWholeFileScan", m___DoPrimaryWholeFileScan, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__DoPrimaryWholeFileScan"), m___DoPrimaryWholeFileScan, ov))
     return co::DoPrimaryWholeFileScan(c, scan_item, end_time);
   return py::truth(py::call(ov, scan_item, py::floating(end_time)));
 }
 bool DoPrimarySingleScopeScan(C *c, Borrowed scan_item, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoPrimarySingleScopeScan", m___DoPrimarySingleScopeScan, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__DoPrimarySingleScopeScan"), m___DoPrimarySingleScopeScan,
+          ov))
     return co::DoPrimarySingleScopeScan(c, scan_item, end_time);
   return py::truth(py::call(ov, scan_item, py::floating(end_time)));
 }
 bool DoSecondaryWholeFileScan(C *c, Borrowed scan_item, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoSecondaryWholeFileScan", m___DoSecondaryWholeFileScan, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__DoSecondaryWholeFileScan"), m___DoSecondaryWholeFileScan,
+          ov))
     return co::DoSecondaryWholeFileScan(c, scan_item, end_time);
   return py::truth(py::call(ov, scan_item, py::floating(end_time)));
 }
 bool DoSecondarySingleScopeScan(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__DoSecondarySingleScopeScan", m___DoSecondarySingleScopeScan, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__DoSecondarySingleScopeScan"),
+          m___DoSecondarySingleScopeScan, ov))
     return co::DoSecondarySingleScopeScan(c, loc, scope_name, end_time);
   return py::truth(py::call(ov, loc, scope_name, py::floating(end_time)));
 }
 void AddImportEquivsToQueue(C *c, Borrowed imported_equivs, Borrowed dirloc, Borrowed priority) {
   py::Ref ov;
-  if (own(c, "_CScanCoordinator__AddImportEquivsToQueue", m___AddImportEquivsToQueue, ov))
+  if (own(c, PY_NAME("_CScanCoordinator__AddImportEquivsToQueue"), m___AddImportEquivsToQueue, ov))
     return co::AddImportEquivsToQueue(c, imported_equivs, dirloc, priority);
   py::call(ov, imported_equivs, dirloc, priority);
 }
 void WaitForScannerToBeReady(C *c, Borrowed scanner, Borrowed scan_item) {
   py::Ref ov;
-  if (own(c, "_WaitForScannerToBeReady", m__WaitForScannerToBeReady, ov))
+  if (own(c, PY_NAME("_WaitForScannerToBeReady"), m__WaitForScannerToBeReady, ov))
     return co::WaitForScannerToBeReady(c, scanner, scan_item);
   py::call(ov, scanner, scan_item);
 }
 py::Ref BuildInstanceScopeNoScanning(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
   py::Ref ov;
-  if (own(c, "BuildInstanceScopeNoScanning", m_BuildInstanceScopeNoScanning, ov))
+  if (own(c, PY_NAME("BuildInstanceScopeNoScanning"), m_BuildInstanceScopeNoScanning, ov))
     return co::BuildInstanceScopeNoScanning(c, loc, scope_name, end_time);
   return py::call(ov, loc, scope_name, py::floating(end_time));
 }
 py::Ref TryToScanNow(C *c, Borrowed loc, Borrowed scope_name, Borrowed scan_name_list,
                      double end_time, Borrowed do_secondary) {
   py::Ref ov;
-  if (own(c, "TryToScanNow", m_TryToScanNow, ov))
+  if (own(c, PY_NAME("TryToScanNow"), m_TryToScanNow, ov))
     return co::TryToScanNow(c, loc, scope_name, scan_name_list, end_time, do_secondary);
   return py::call(ov, loc, scope_name, scan_name_list, py::floating(end_time));
 }
 py::Ref TryToScanInstanceScopeNow(C *c, Borrowed loc, Borrowed scope_name, double end_time) {
   py::Ref ov;
-  if (own(c, "_TryToScanInstanceScopeNow", m__TryToScanInstanceScopeNow, ov))
+  if (own(c, PY_NAME("_TryToScanInstanceScopeNow"), m__TryToScanInstanceScopeNow, ov))
     return co::TryToScanInstanceScopeNow(c, loc, scope_name, end_time);
   return py::call(ov, loc, scope_name, py::floating(end_time));
 }
 void AddNeedsScanSetToQueues(C *c, Borrowed needs_scan_set) {
   py::Ref ov;
-  if (own(c, "AddNeedsScanSetToQueues", m_AddNeedsScanSetToQueues, ov))
+  if (own(c, PY_NAME("AddNeedsScanSetToQueues"), m_AddNeedsScanSetToQueues, ov))
     return co::AddNeedsScanSetToQueues(c, needs_scan_set);
   py::call(ov, needs_scan_set);
 }

@@ -32,8 +32,8 @@ int64_t g_interp_id = -1;
 // ---- records -------------------------------------------------------------
 
 py::Ref namedtuple(py::Borrowed fields_or_names, const char *name, py::Borrowed module_name) {
-  py::Ref nt = py::getattr(host::modules->collections, "namedtuple");
-  py::Ref kw = py::check(PyTuple_Pack(1, py::interned("module").get()));
+  py::Ref nt = py::getattr(host::modules->collections, PY_NAME("namedtuple"));
+  py::Ref kw = py::check(PyTuple_Pack(1, PY_NAME("module").get()));
   py::Ref tname = py::str(name);
   PyObject *argv[] = {tname.get(), fields_or_names.get(), module_name.get()};
   return py::call_kw(nt, argv, 2, kw);
@@ -70,7 +70,7 @@ py::Ref import_module(const char *name) { return py::check(PyImport_ImportModule
 py::Ref import_from(const char *package, const char *name) {
   py::Ref fromlist = py::check(PyTuple_Pack(1, py::str(name).get()));
   py::Ref pkg = py::check(PyImport_ImportModuleLevel(package, nullptr, nullptr, fromlist.get(), 0));
-  return py::getattr(pkg, name);
+  return py::getattr(pkg, py::intern(name));
 }
 
 void bind(py::Borrowed dict, const char *name, py::Borrowed value) {
@@ -79,7 +79,7 @@ void bind(py::Borrowed dict, const char *name, py::Borrowed value) {
 
 void exec_body(py::Borrowed module) {
   py::Ref dict = py::Ref::borrow(PyModule_GetDict(module.get()));
-  py::Ref mod_name = py::getattr(module, "__name__");
+  py::Ref mod_name = py::getattr(module, PY_NAME("__name__"));
   // The package this module lives in ("pysource" for the engine).
   py::Ref package;
   {
@@ -141,11 +141,12 @@ void exec_body(py::Borrowed module) {
 
   auto *st = new State;
   st->module = py::Ref::borrow(module.get());
-  py::Ref sys_flags = py::getattr(m->sys, "flags");
-  st->debug = py::as_ll(py::getattr(sys_flags, "optimize")) == 0;
-  st->defaultdict = py::getattr(m->collections, "defaultdict");
+  py::Ref sys_flags = py::getattr(m->sys, PY_NAME("flags"));
+  st->debug = py::as_ll(py::getattr(sys_flags, PY_NAME("optimize"))) == 0;
+  st->defaultdict = py::getattr(m->collections, PY_NAME("defaultdict"));
   st->int_type = py::Ref::borrow(reinterpret_cast<PyObject *>(&PyLong_Type));
-  st->kWildcardScope = py::getattr(m->symbolinfo, "kWildcardScope");
+  st->one = py::integer(1);
+  st->kWildcardScope = py::getattr(m->symbolinfo, PY_NAME("kWildcardScope"));
   st->not_found_result = py::check(Py_BuildValue("(OOO)", Py_False, Py_None, Py_None));
   st->waiting_result = py::check(Py_BuildValue("(OOO)", Py_True, Py_None, Py_None));
   state = st;
@@ -180,11 +181,11 @@ void exec_body(py::Borrowed module) {
     st->CSingleQueueStatus =
         namedtuple(py::str("scan_name priority file_count"), "CSingleQueueStatus", mod_name);
     bind(dict, "CSingleQueueStatus", st->CSingleQueueStatus);
-    py::setattr(st->CSingleQueueStatus, py::interned("__module__"), mod_name);
+    py::setattr(st->CSingleQueueStatus, PY_NAME("__module__"), mod_name);
     st->CScanStatus =
         namedtuple(py::str("queue_status_list waiting_count"), "CScanStatus", mod_name);
     bind(dict, "CScanStatus", st->CScanStatus);
-    py::setattr(st->CScanStatus, py::interned("__module__"), mod_name);
+    py::setattr(st->CScanStatus, PY_NAME("__module__"), mod_name);
   }
   // 9. the coordinator
   st->CoordinatorType = create_coordinator_type(module);
@@ -272,8 +273,16 @@ py::Ref make_scan_item(py::Borrowed loc, py::Borrowed scope, py::Borrowed scan_n
 py::Ref item_field(py::Borrowed item, int index) {
   if (PyTuple_Check(item.get()) && PyTuple_GET_SIZE(item.get()) == 4)
     return py::Ref::borrow(PyTuple_GET_ITEM(item.get(), index));
-  static const char *fields[] = {"loc", "scope_name", "scan_name", "priority"};
-  return py::getattr(item, fields[index]);
+  switch (index) {
+  case 0:
+    return py::getattr(item, PY_NAME("loc"));
+  case 1:
+    return py::getattr(item, PY_NAME("scope_name"));
+  case 2:
+    return py::getattr(item, PY_NAME("scan_name"));
+  default:
+    return py::getattr(item, PY_NAME("priority"));
+  }
 }
 
 void assertion_failed(const char *text) {
@@ -284,8 +293,15 @@ void assertion_failed(const char *text) {
   py::throw_error();
 }
 
+PyObject *const *intern_names(const char *const *names, int n) {
+  auto *keys = new PyObject *[n > 0 ? n : 1];
+  for (int i = 0; i < n; ++i)
+    keys[i] = py::intern(names[i]).release();
+  return keys;
+}
+
 void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames,
-                const char *const *names, int required, int total, PyObject **out) {
+                PyObject *const *keys, int required, int total, PyObject **out) {
   for (int i = 0; i < total; ++i)
     out[i] = nullptr;
   if (nargs > total) {
@@ -300,11 +316,16 @@ void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyOb
     for (Py_ssize_t k = 0; k < nkw; ++k) {
       PyObject *key = PyTuple_GET_ITEM(kwnames, k);
       int found = -1;
-      for (int i = 0; i < total; ++i) {
-        if (PyUnicode_CompareWithASCIIString(key, names[i]) == 0) {
+      for (int i = 0; i < total && found < 0; ++i)
+        if (key == keys[i])
           found = i;
-          break;
-        }
+      for (int i = 0; i < total && found < 0; ++i) {
+        // Keyword names are strs (subclasses included): compared as text.
+        const int r = PyUnicode_Compare(key, keys[i]);
+        if (r == -1 && PyErr_Occurred())
+          py::throw_error();
+        if (r == 0)
+          found = i;
       }
       if (found < 0) {
         PyErr_Format(PyExc_TypeError, msg::kUnexpectedKeyword, fname, key);

@@ -27,6 +27,7 @@ struct State {
   py::Ref kWildcardScope;   // symbolinfo.kWildcardScope ('*')
   py::Ref empty_item;       // CScanItem(None, None, None, None)
   py::Ref priorities[3];    // the three published priority ints
+  py::Ref one;              // the int 1, a count's first value and step
   py::Ref not_found_result; // (False, None, None), shared
   py::Ref waiting_result;   // (True, None, None), shared
   PyTypeObject *SingleQueueType = nullptr;
@@ -65,6 +66,34 @@ inline py::Ref untrack_if_atomic(py::Ref t) {
 // index (its fields are positional), anything else by attribute name.
 py::Ref item_field(py::Borrowed item, int index);
 
+// The fields of a CScanItem-like object, read once: borrowed from a tuple
+// (kept alive by holding the item, whose items cannot be replaced), fetched
+// by name otherwise.  `wanted` (bit i for field i) names the fields the caller
+// reads, so that an object that is not a tuple sees only those attribute
+// reads, in field order; the others stay null.
+class ItemFields {
+public:
+  explicit ItemFields(py::Borrowed item, unsigned wanted = 0xF) : item_(item.ref()) {
+    if (PyTuple_Check(item.get()) && PyTuple_GET_SIZE(item.get()) == 4) {
+      for (int i = 0; i < 4; ++i)
+        v_[i] = PyTuple_GET_ITEM(item.get(), i);
+      return;
+    }
+    for (int i = 0; i < 4; ++i) {
+      if (!(wanted & (1u << i)))
+        continue;
+      owned_[i] = item_field(item, i);
+      v_[i] = owned_[i].get();
+    }
+  }
+  py::Borrowed operator[](int i) const { return py::Borrowed(v_[i]); }
+
+private:
+  py::Ref item_;
+  py::Ref owned_[4];
+  PyObject *v_[4] = {};
+};
+
 // Raise AssertionError (with an optional message), as a failed `assert`.
 [[noreturn]] void assertion_failed(const char *msg = nullptr);
 
@@ -85,12 +114,16 @@ constexpr const char *kInterpreterChange = "Interpreter change detected - this m
                                            "loaded into one interpreter per process.";
 } // namespace msg
 
-// Argument parsing for METH_FASTCALL | METH_KEYWORDS methods.  `names` has
-// `total` entries, the first `required` of which are mandatory; `out` receives
+// Argument parsing for METH_FASTCALL | METH_KEYWORDS methods.  `keys` holds
+// the `total` parameter names as interned strs (made once by intern_names),
+// the first `required` of which are mandatory; keywords are matched to them
+// by identity, with string equality as the fallback.  `out` receives
 // borrowed references (nullptr for an omitted optional argument).  Raises the
 // interpreter's usual TypeErrors.
 void parse_args(const char *fname, PyObject *const *args, Py_ssize_t nargs, PyObject *kwnames,
-                const char *const *names, int required, int total, PyObject **out);
+                PyObject *const *keys, int required, int total, PyObject **out);
+// The interned strs of `n` parameter names, kept for the life of the process.
+PyObject *const *intern_names(const char *const *names, int n);
 
 // Unpack a 2- or 3-item sequence the way Python's tuple unpacking does
 // (tuples and lists fast, any iterable otherwise).

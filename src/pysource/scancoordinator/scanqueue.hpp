@@ -32,6 +32,8 @@ using Q = ScanQueueObject;
 using py::Borrowed;
 using py::Ref;
 
+struct LocInfo;
+
 // ---- structure, adding and removing --------------------------------------
 void init(Q *q, Borrowed location_data_cache);
 void SetScansToOrder(Q *q, Borrowed scans_to_order);
@@ -45,7 +47,9 @@ void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority
 // call.  It may hold every pair of a large batch, so it avoids one large
 // transient buffer that the C allocator would keep resident afterwards:
 //  - as a view, it refers to the caller's tuple of pairs and records which of
-//    them are taken as runs of indices (usually a single run);
+//    them are taken as runs of indices (usually a single run, kept inline);
+//  - as a single pair, it holds that pair inline (the coordinator queues one
+//    pair after each scan);
 //  - otherwise it owns the pairs, in small blocks from Python's allocator.
 struct PairRef {
   Borrowed first, second;
@@ -66,11 +70,13 @@ public:
   PairList() = default;
   // A view over `pairs`, a tuple whose items are 2-tuples.
   explicit PairList(Ref pairs) : view_(std::move(pairs)) {}
+  // The one pair (a, b).
+  PairList(Borrowed a, Borrowed b) : one_{a.ref(), b.ref()}, size_(1) {}
   PairList(const PairList &) = delete;
   PairList &operator=(const PairList &) = delete;
   PairList(PairList &&o) noexcept
-      : view_(std::move(o.view_)), runs_(std::move(o.runs_)), head_(o.head_), tail_(o.tail_),
-        size_(o.size_) {
+      : view_(std::move(o.view_)), run_(o.run_), more_runs_(std::move(o.more_runs_)),
+        one_(std::move(o.one_)), head_(o.head_), tail_(o.tail_), size_(o.size_) {
     o.head_ = o.tail_ = nullptr;
     o.size_ = 0;
   }
@@ -101,10 +107,14 @@ public:
   }
   // View mode: take the pair at index i (indices ascending).
   void take(Py_ssize_t i) {
-    if (!runs_.empty() && runs_.back().end == i)
-      ++runs_.back().end;
+    if (size_ == 0)
+      run_ = Run{i, i + 1};
+    else if (more_runs_.empty() && run_.end == i)
+      ++run_.end;
+    else if (!more_runs_.empty() && more_runs_.back().end == i)
+      ++more_runs_.back().end;
     else
-      runs_.push_back(Run{i, i + 1});
+      more_runs_.push_back(Run{i, i + 1});
     ++size_;
   }
   size_t size() const { return size_; }
@@ -113,11 +123,21 @@ public:
   // Calls f(PairRef) for every pair, in order.
   template <typename F> void for_each(F &&f) const {
     if (view_) {
-      for (const Run &r : runs_)
+      if (size_ == 0)
+        return;
+      auto walk = [&](const Run &r) {
         for (Py_ssize_t i = r.begin; i < r.end; ++i) {
           PyObject *pair = PyTuple_GET_ITEM(view_.get(), i);
           f(PairRef{Borrowed(PyTuple_GET_ITEM(pair, 0)), Borrowed(PyTuple_GET_ITEM(pair, 1))});
         }
+      };
+      walk(run_);
+      for (const Run &r : more_runs_)
+        walk(r);
+      return;
+    }
+    if (one_.first) {
+      f(PairRef{Borrowed(one_.first), Borrowed(one_.second)});
       return;
     }
     for (const Block *b = head_; b; b = b->next)
@@ -127,22 +147,32 @@ public:
 
 private:
   Ref view_;
-  std::vector<Run> runs_;
+  Run run_{0, 0};
+  std::vector<Run> more_runs_;
+  std::pair<Ref, Ref> one_;
   Block *head_ = nullptr;
   Block *tail_ = nullptr;
   size_t size_ = 0;
 };
+// AddScanPairs([(loc, scope)], ...) without the one-pair sequence.
+void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                 bool add_to_check);
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 void AddScanToPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
                              Borrowed priority, Borrowed key);
 bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name,
                                   Borrowed priority, Borrowed key);
+// `known` is the location's record when the caller has just read it; it is
+// used only if it is still current.
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key);
+                      bool remove_waiting, Borrowed key, const LocInfo *known = nullptr);
 void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting);
+// RemoveAllForLocations([loc], ...), without the one-item sequence.
+void RemoveAllForLocation(Q *q, Borrowed loc, Borrowed scan_name_set, bool remove_waiting);
 void Clear(Q *q);
-void ScanCompleted(Q *q, Borrowed scan_item);
+// `key` is the scan's (scope, scan name) tuple when the caller has it.
+void ScanCompleted(Q *q, Borrowed scan_item, Borrowed key = Borrowed());
 void destroy_impl(Q *q);
 
 // ---- retrieval and queries -----------------------------------------------
@@ -182,10 +212,13 @@ void SignalEmitIdle(Q *q);
 namespace call {
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check);
+// AddScanPairs([(loc, scope)], ...) without the one-pair sequence.
+void AddScanPair(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                 bool add_to_check);
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check);
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key);
+                      bool remove_waiting, Borrowed key, const LocInfo *known = nullptr);
 Ref FirstOrNone(Q *q);
 void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set);
 void LocationAdded(Q *q, Borrowed loc);
@@ -198,16 +231,35 @@ void Clear(Q *q);
 
 // ---- shared helpers ------------------------------------------------------
 // The (counts, pending) pair stored for a location; both empty if absent.
+// `table` and `version` say which state of _fPerLocationInfo it was read
+// from: while that dictionary is unchanged, a new lookup would find the same
+// record (a tuple, whose two dictionaries cannot be swapped for others).
 struct LocInfo {
   Ref tuple, counts, pending;
+  PyObject *table = nullptr;
+  uint64_t version = 0;
   explicit operator bool() const { return bool(tuple); }
+  bool current(const Q *q) const;
 };
 LocInfo loc_info(Q *q, Borrowed loc);
 // A name list as stored in a single queue (TypeError if not a list).
 PyListObject *as_name_list(Borrowed v);
+// Name lists and the cyclic GC.  A name list holds scope names, strs that
+// can be part of no cycle, so the queue keeps its lists untracked while they
+// hold only such names (as the collector does by itself for tuples and
+// dictionaries of atomic items): a batch of thousands of new locations then
+// leaves the collector nothing new to walk, and no full collection follows.
+// The list made for a first name; untracked unless the name is tracked.
+Ref new_name_list(Borrowed name);
+// After `name` was put into `list`: a tracked name tracks the list again.
+void name_added(Borrowed list, Borrowed name);
+// A list the queue filled with names: untracked if they are all atomic.
+void untrack_name_list(Borrowed list);
 // bisect.bisect_left(list, x)
 Py_ssize_t bisect_left(Borrowed list, Borrowed x);
-Ref make_key(Borrowed scope, Borrowed scan_name);
+// The (scope, scan name) key tuple, the queue's shared one for this pair of
+// name objects (see KeyTable).
+Ref make_key(Q *q, Borrowed scope, Borrowed scan_name);
 // A priority as stored: an int object of the given value.
 Ref priority_obj(long long p);
 

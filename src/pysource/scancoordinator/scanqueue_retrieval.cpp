@@ -63,10 +63,21 @@ Ref PopWholeFilesToCheck(Q *q, Py_ssize_t max_files) {
   Ref whole = q->f._fWholeFilesToCheck;
   if (PyDict_GET_SIZE(whole.get()) == 0)
     return Ref::none();
-  static Ref *s_popitem = new Ref(py::interned("popitem"));
+  // dict.popitem itself, called on the table (an exact dict: the field is
+  // ours) without looking the method up for every file.
+  static PyObject *popitem = [] {
+    PyObject *m = PyDict_GetItemWithError(PyDict_Type.tp_dict, PY_NAME("popitem").get());
+    if (!m && !PyErr_Occurred())
+      PyErr_SetString(PyExc_SystemError, "dict.popitem not found");
+    if (!m)
+      py::throw_error();
+    return m; // lives as long as the dict type
+  }();
   Ref result = py::new_list();
   while (PyList_GET_SIZE(result.get()) <= max_files && PyDict_GET_SIZE(whole.get()) != 0)
-    py::list_append(result, py::call_method(whole, *s_popitem));
+    py::list_append(result, PyDict_CheckExact(whole.get())
+                                ? py::call(Borrowed(popitem), whole)
+                                : py::call_method(whole, PY_NAME("popitem")));
   if (!q->f.fAnyAsyncInspectLocation)
     return result;
   Ref ready = py::new_list();
@@ -242,6 +253,7 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
       om::del(from->f.fOrderedDict, loc);
     if (PyList_GET_SIZE(names.get()) == 0)
       return;
+    untrack_name_list(names);
   }
   as_name_list(names);
   Ref to_prio = priority_obj(to->f.fPriority);
@@ -270,11 +282,12 @@ void MoveScansBetweenQueues(Q *q, Borrowed loc, Borrowed names_to_move, Borrowed
         Ref name = Ref::borrow(PyList_GET_ITEM(names.get(), i));
         Py_ssize_t at = bisect_left(target, name);
         py::check_int(PyList_Insert(target.get(), at, name.get()));
+        name_added(target, name);
       }
     }
   }
   for (Py_ssize_t i = 0; i < PyList_GET_SIZE(names.get()); ++i) {
-    Ref key = make_key(Borrowed(PyList_GET_ITEM(names.get(), i)), to_name);
+    Ref key = make_key(q, Borrowed(PyList_GET_ITEM(names.get(), i)), to_name);
     py::dict_set(info.pending, key, to_prio);
   }
 }
@@ -287,7 +300,7 @@ void CB_SingletonChanged(Q *q) {
   if (gui.is_none())
     return;
   Borrowed self(reinterpret_cast<PyObject *>(q));
-  Ref handler = py::getattr(self, "_CB_ActiveDocChanged");
+  Ref handler = py::getattr(self, PY_NAME("_CB_ActiveDocChanged"));
   Ref cb = host::mainloop::NoArgCallback(handler);
   host::objectmodel::connect_while_alive(gui, host::names().active_document_changed, cb, self);
 }
@@ -318,7 +331,7 @@ Py_ssize_t write_for_loc(Borrowed write, Borrowed loc, Borrowed name_list, Py_ss
   Py_ssize_t count = 1;
   py::for_each_while(name_list, [&](Borrowed name) {
     if (count >= loc_limit) {
-      write_text(write, py::interned("    ...\n"));
+      write_text(write, PY_NAME("    ...\n"));
       return false;
     }
     write_fmt(write, "    %U\n", fmt(name));
@@ -333,10 +346,10 @@ Py_ssize_t write_for_loc(Borrowed write, Borrowed loc, Borrowed name_list, Py_ss
 void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
   Ref write;
   if (!write_arg || write_arg.is_none())
-    write = py::getattr(py::getattr(host::modules->sys, "stdout"), host::names().write);
+    write = py::getattr(py::getattr(host::modules->sys, PY_NAME("stdout")), host::names().write);
   else
     write = write_arg.ref();
-  write_text(write, py::interned("_CScanQueue contents:\n"));
+  write_text(write, PY_NAME("_CScanQueue contents:\n"));
   Py_ssize_t count = 0;
   Ref queues = py::check(
       PyList_GetSlice(q->f._fOrderedQueues.get(), 0, PyList_GET_SIZE(q->f._fOrderedQueues.get())));
@@ -351,7 +364,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     if (count < limit) {
       py::for_each_while(om::items(uod), [&](Borrowed pair) {
         if (count >= limit) {
-          write_text(write, py::interned("  ...\n"));
+          write_text(write, PY_NAME("  ...\n"));
           return false;
         }
         Ref parts[2];
@@ -360,7 +373,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
         return true;
       });
     } else {
-      write_text(write, py::interned("  ...\n"));
+      write_text(write, PY_NAME("  ...\n"));
     }
   }
   Ref waiting = q->f._fWaitingForInspectByLoc;
@@ -373,7 +386,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     for (Py_ssize_t i = 0; i < PyList_GET_SIZE(keys.get()) && i < limit; ++i)
       write_fmt(write, "  File: %U\n", py::check(PyObject_Repr(PyList_GET_ITEM(keys.get(), i))));
     if (nwait >= limit)
-      write_text(write, py::interned("  ...\n"));
+      write_text(write, PY_NAME("  ...\n"));
   }
   Ref data = q->f._fScanItemsWaitingForData;
   Py_ssize_t ndata = PySet_GET_SIZE(data.get());
@@ -384,7 +397,7 @@ void PrintScanQueues(Q *q, Borrowed write_arg, Py_ssize_t limit) {
     for (Py_ssize_t i = 0; i < PyList_GET_SIZE(items.get()) && i < limit; ++i)
       write_fmt(write, "  Scan: %U\n", py::check(PyObject_Repr(PyList_GET_ITEM(items.get(), i))));
     if (ndata >= limit)
-      write_text(write, py::interned("  ...\n"));
+      write_text(write, PY_NAME("  ...\n"));
   }
 }
 

@@ -3,6 +3,7 @@
 // __init__ has run, and calls the C++ logic in the scanqueue_* units.
 #include "pysource/scancoordinator/scanqueue.hpp"
 #include "pysource/scancoordinator/typeutil.hpp"
+#include "host/hostmodules.hpp"
 
 namespace scancoord {
 
@@ -27,6 +28,12 @@ struct Fields : ScanQueueFields {
     f(_fVisibleDocLocs);
     f(_fGuiMgr);
     f(_fWholeFilesToCheck);
+    for (auto &a : single_queue_answers) {
+      f(a.scan_name);
+      f(a.orders);
+      f(a.queues);
+      f(a.queue);
+    }
   }
   int visit(visitproc v, void *arg) {
     int r = 0;
@@ -34,11 +41,12 @@ struct Fields : ScanQueueFields {
       if (!r)
         r = ref.visit(v, arg);
     });
-    return r;
+    return r ? r : keys.visit(v, arg);
   }
   void clear() {
     initialised = false;
     each([](py::Ref &ref) { ref.reset(); });
+    keys.clear();
   }
 };
 static_assert(sizeof(Fields) == sizeof(ScanQueueFields));
@@ -102,6 +110,9 @@ SC_METHOD(SetScansToOrder){PY_GUARD(nullptr,
     PY_GUARD(nullptr,
              {
                SC_ARGS("AddScanPairs", 2, "pair_seq", "scan_name", "priority", "add_to_check");
+               // One call asks the location module's predicate for every pair:
+               // it is read from the module once for the call.
+               host::Snapshot snapshot;
                sq::AddScanPairs(queue(self), arg(a[0]), arg(a[1]), arg(a[2]), flag(a[3], false));
                return none();
              })} SC_METHOD(_AddReadyScanPairs){
@@ -397,7 +408,7 @@ PyType_Spec spec = {"pysource.scancoordinator._CScanQueue", sizeof(Obj), 0,
 
 // ---- dispatch ------------------------------------------------------------
 
-bool own(Q *q, const char *name, FastMethod fn, py::Ref &override_out) {
+bool own(Q *q, py::Borrowed name, FastMethod fn, py::Ref &override_out) {
   return own_method(reinterpret_cast<PyObject *>(q), state->ScanQueueType, name, fn, override_out);
 }
 
@@ -423,41 +434,41 @@ using py::Ref;
 void AddScanPairs(Q *q, Borrowed pair_seq, Borrowed scan_name, Borrowed priority,
                   bool add_to_check) {
   py::Ref ov;
-  if (own(q, "AddScanPairs", m_AddScanPairs, ov))
+  if (own(q, PY_NAME("AddScanPairs"), m_AddScanPairs, ov))
     return sq::AddScanPairs(q, pair_seq, scan_name, priority, add_to_check);
   py::call(ov, pair_seq, scan_name, or_none_b(priority), pybool(add_to_check));
 }
 void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed priority,
                        bool add_to_check) {
   py::Ref ov;
-  if (own(q, "_AddReadyScanPairs", m__AddReadyScanPairs, ov))
+  if (own(q, PY_NAME("_AddReadyScanPairs"), m__AddReadyScanPairs, ov))
     return sq::AddReadyScanPairs(q, pairs, scan_name, priority, add_to_check);
   py::call(ov, pair_list(pairs), scan_name, or_none_b(priority), pybool(add_to_check));
 }
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
-                      bool remove_waiting, Borrowed key) {
+                      bool remove_waiting, Borrowed key, const LocInfo *known) {
   py::Ref ov;
-  if (own(q, "RemoveScanTriple", m_RemoveScanTriple, ov))
-    return sq::RemoveScanTriple(q, loc, scope, scan_name, priority, remove_waiting, key);
+  if (own(q, PY_NAME("RemoveScanTriple"), m_RemoveScanTriple, ov))
+    return sq::RemoveScanTriple(q, loc, scope, scan_name, priority, remove_waiting, key, known);
   py::Ref triple = py::check(PyTuple_Pack(3, loc.get(), scope.get(), scan_name.get()));
   return py::truth(py::call(ov, triple, or_none_b(priority), pybool(remove_waiting)));
 }
 Ref FirstOrNone(Q *q) {
   py::Ref ov;
-  if (own(q, "_FirstOrNone", m__FirstOrNone, ov))
+  if (own(q, PY_NAME("_FirstOrNone"), m__FirstOrNone, ov))
     return sq::FirstOrNone(q);
   py::Ref r = py::call(ov);
   return r.is_none() ? py::Ref() : r;
 }
 void UpdatePendingSets(Q *q, Borrowed added_set, Borrowed removed_set) {
   py::Ref ov;
-  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+  if (own(q, PY_NAME("_UpdatePendingSets"), m__UpdatePendingSets, ov))
     return sq::UpdatePendingSets(q, added_set, removed_set);
   py::call(ov, or_none_b(added_set), or_none_b(removed_set));
 }
 void LocationAdded(Q *q, Borrowed loc) {
   py::Ref ov;
-  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+  if (own(q, PY_NAME("_UpdatePendingSets"), m__UpdatePendingSets, ov))
     return sq::LocationAdded(q, loc);
   py::Ref added = py::new_set(), removed = py::new_set();
   py::set_add(added, loc);
@@ -465,7 +476,7 @@ void LocationAdded(Q *q, Borrowed loc) {
 }
 void LocationRemoved(Q *q, Borrowed loc) {
   py::Ref ov;
-  if (own(q, "_UpdatePendingSets", m__UpdatePendingSets, ov))
+  if (own(q, PY_NAME("_UpdatePendingSets"), m__UpdatePendingSets, ov))
     return sq::LocationRemoved(q, loc);
   py::Ref removed = py::new_set();
   py::set_add(removed, loc);
@@ -473,7 +484,7 @@ void LocationRemoved(Q *q, Borrowed loc) {
 }
 Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
   py::Ref ov;
-  if (own(q, "_GetSingleQueue", m__GetSingleQueue, ov))
+  if (own(q, PY_NAME("_GetSingleQueue"), m__GetSingleQueue, ov))
     return sq::GetSingleQueue(q, scan_name, priority);
   py::Ref r = py::call(ov, scan_name, py::integer(priority));
   as_single_queue(r.get());
@@ -481,19 +492,20 @@ Ref GetSingleQueue(Q *q, Borrowed scan_name, long long priority) {
 }
 bool IsTreeBranchReady(Q *q, Borrowed loc) {
   py::Ref ov;
-  if (own(q, "IsTreeBranchReady", m_IsTreeBranchReady, ov))
+  if (own(q, PY_NAME("IsTreeBranchReady"), m_IsTreeBranchReady, ov))
     return sq::IsTreeBranchReady(q, loc);
   return py::truth(py::call(ov, loc));
 }
 void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_priority) {
   py::Ref ov;
-  if (own(q, "_MoveScansForLocToWaitingForInspect", m__MoveScansForLocToWaitingForInspect, ov))
+  if (own(q, PY_NAME("_MoveScansForLocToWaitingForInspect"), m__MoveScansForLocToWaitingForInspect,
+          ov))
     return sq::MoveScansForLocToWaitingForInspect(q, loc, check_priority);
   py::call(ov, loc, or_none_b(check_priority));
 }
 void Clear(Q *q) {
   py::Ref ov;
-  if (own(q, "Clear", m_Clear, ov))
+  if (own(q, PY_NAME("Clear"), m_Clear, ov))
     return sq::Clear(q);
   py::call(ov);
 }

@@ -44,8 +44,7 @@ void MoveScansForLocToWaitingForInspect(Q *q, Borrowed loc, Borrowed check_prior
     if (!check)
       check = Ref::none();
   }
-  Ref one = py::check(PyTuple_Pack(1, loc.get()));
-  RemoveAllForLocations(q, one, Borrowed(), false);
+  RemoveAllForLocation(q, loc, Borrowed(), false);
   AddItemsWaitingForInspect(q, loc, items);
   SetWholeFileCheckWaitingForInspect(q, loc, check);
 }
@@ -63,7 +62,7 @@ void AddItemsWaitingForInspect(Q *q, Borrowed loc, Borrowed item_seq) {
   if (PyAnySet_Check(parts[0].get())) {
     py::for_each(item_seq, [&](Borrowed item) { py::set_add(parts[0], item); });
   } else {
-    static Ref *s_update = new Ref(py::interned("update"));
+    static Ref *s_update = new Ref(PY_NAME("update"));
     py::call_method(parts[0], *s_update, item_seq);
   }
 }
@@ -84,7 +83,7 @@ void SetWholeFileCheckWaitingForInspect(Q *q, Borrowed loc, Borrowed check_prior
 }
 
 void CB_TreeBranchesNowReady(Q *q, Borrowed, Borrowed ready_set) {
-  static Ref *s_intersection = new Ref(py::interned("intersection"));
+  static Ref *s_intersection = new Ref(PY_NAME("intersection"));
   Ref waiting = q->f._fWaitingForInspectByLoc;
   Ref ready = py::call_method(ready_set, *s_intersection, waiting);
   if (!py::truth(ready))
@@ -147,7 +146,7 @@ namespace {
 void schedule_emission(Q *q) {
   if (q->f._fSignalEmitIdle && !q->f._fSignalEmitIdle.is_none())
     return;
-  Ref cb = py::getattr(Borrowed(reinterpret_cast<PyObject *>(q)), "_SignalEmitIdle");
+  Ref cb = py::getattr(Borrowed(reinterpret_cast<PyObject *>(q)), PY_NAME("_SignalEmitIdle"));
   q->f._fSignalEmitIdle = host::mainloop::idle_add(cb);
 }
 

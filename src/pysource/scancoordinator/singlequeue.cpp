@@ -58,6 +58,7 @@ int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
     PY_GUARD(-1,
              {
                static const char *const names[] = {"scan_name", "priority", "order"};
+               static PyObject *const *const keys = intern_names(names, 3);
                // Route through the vectorcall-style parser for identical messages.
                Py_ssize_t nargs = PyTuple_GET_SIZE(args);
                py::Ref kwnames;
@@ -73,7 +74,7 @@ int tp_init(PyObject *self, PyObject *args, PyObject *kwds){
                  }
                }
                PyObject *out[3];
-               parse_args("__init__", argv.data(), nargs, kwnames.get(), names, 3, 3, out);
+               parse_args("__init__", argv.data(), nargs, kwnames.get(), keys, 3, 3, out);
                // The base class first, with no signals: a single queue emits nothing.
                host::objectmodel::base_init(py::Borrowed(self), py::Borrowed());
                auto *obj = reinterpret_cast<Obj *>(self);

@@ -65,8 +65,9 @@ inline bool flag(PyObject *o, bool dflt) { return o ? py::truth(py::Borrowed(o))
 #define SC_ARGS(fname, required, ...)                                                              \
   static const char *const names_[] = {__VA_ARGS__};                                               \
   constexpr int total_ = sizeof(names_) / sizeof(names_[0]);                                       \
+  static PyObject *const *const keys_ = intern_names(names_, total_);                              \
   PyObject *a[total_];                                                                             \
-  parse_args(fname, args, nargs, kwnames, names_, required, total_, a)
+  parse_args(fname, args, nargs, kwnames, keys_, required, total_, a)
 #define SC_NOARGS(fname) parse_args(fname, args, nargs, kwnames, nullptr, 0, 0, nullptr)
 #define SC_DEF(name, doc)                                                                          \
   {#name, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(m_##name)),                   \
@@ -80,7 +81,7 @@ using FastMethod = PyObject *(*)(PyObject *, PyObject *const *, Py_ssize_t, PyOb
 // for an instance of `exact` itself (no attribute lookup); for a subclass
 // instance when the attribute is still our built-in method bound to it.
 // Otherwise `override_out` receives the attribute to call.
-inline bool own_method(PyObject *self, PyTypeObject *exact, const char *name, FastMethod fn,
+inline bool own_method(PyObject *self, PyTypeObject *exact, py::Borrowed name, FastMethod fn,
                        py::Ref &override_out) {
   if (Py_TYPE(self) == exact)
     return true;

@@ -520,6 +520,14 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   return true;
 }
 
+namespace {
+
+// Takes one scan out of the single queues and the per-location records.
+bool remove_ready_scan(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                       Borrowed key);
+
+} // namespace
+
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
                       bool remove_waiting, Borrowed key) {
   Ref waiting = q->f._fWaitingForInspectByLoc;
@@ -553,9 +561,20 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
           py::throw_error();
         Ref popped = py::check(PyObject_CallMethod(waiting.get(), "pop", "OO", loc.get(), Py_None));
       }
-      return !to_remove.empty();
+      // A location with parked work may also have ready scans (queued after
+      // its branch became ready, or resumed after waiting for data): the
+      // matching one leaves the ready queue too, the parked work stays.
+      const bool ready_removed = remove_ready_scan(q, loc, scope, scan_name, priority, key);
+      return !to_remove.empty() || ready_removed;
     }
   }
+  return remove_ready_scan(q, loc, scope, scan_name, priority, key);
+}
+
+namespace {
+
+bool remove_ready_scan(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                       Borrowed key) {
   Ref prio;
   if (priority && !priority.is_none()) {
     prio = priority.ref();
@@ -582,6 +601,8 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   }
   return false;
 }
+
+} // namespace
 
 void RemoveAllForLocations(Q *q, Borrowed loc_seq, Borrowed scan_name_set, bool remove_waiting) {
   const bool all_names = !scan_name_set || scan_name_set.is_none();

@@ -44,7 +44,7 @@ from guiutils import ostrelgtk
 from ostrelbase import location, mime
 from rich.console import Console
 
-from pysource import infodb
+from pysource import helperproc, infodb
 
 ROOT = Path(__file__).resolve().parent.parent
 kExitWriteFailed = 1
@@ -213,6 +213,11 @@ def Run(app: hostapp.CApplication, root: Path, db: str, args: argparse.Namespace
             files = app.fRemote.Locations(files)
             app.fRemote.Adopt(app.fAnaMgr)
             outstanding.append(app.fRemote.Busy)
+        if args.helper:
+            app.fHelper = helperproc.CHelperProcessSupport(app.fAnaMgr, str(root))
+            app.fHelper.Start()
+            coord._UpdateForHelperProcess()
+            outstanding.append(app.fHelper.Busy)
         progress = scanreport.MakeProgress(console, args.plain, args.quiet or json_to_stdout)
         tracker = scanreport.CProgressTracker(app, coord, str(root), time.perf_counter())
 
@@ -239,6 +244,8 @@ def Run(app: hostapp.CApplication, root: Path, db: str, args: argparse.Namespace
             summary['outcome'] = 'stopped'
     finally:
         timing.Uninstall()
+        if app.fHelper is not None:
+            app.fHelper.destroy()
         app.Shutdown()
         if app.fRemote is not None:
             app.fRemote.Close()
@@ -286,7 +293,8 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
 
     scans = {'primary_whole_file': 0, 'primary_single_scope': 0,
              'derived_whole_file': 0, 'derived_single_scope': 0}
-    scanned = set()
+    helper = getattr(app, 'fHelper', None)
+    scanned = set(helper.fScanned) if helper is not None else set()
     for (loc, scope, scan_name), n in coord._fScanTripleCompletedCount.items():
         kind = 'primary' if scan_name == primary else 'derived' if scan_name == derived else None
         if kind is None:
@@ -294,6 +302,8 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
         scans[f"{kind}_{'whole_file' if scope == '*' else 'single_scope'}"] += n
         if kind == 'primary':
             scanned.add(loc)
+    if helper is not None:
+        scans['primary_whole_file'] += len(helper.fScanned)
     scans['total'] = sum(scans.values())
     problems = app.fSingletons.fCacheMgr.fReadProblems
     scanned.difference_update(problems)  # abandoned: the coordinator counts them as done
@@ -373,6 +383,15 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
             'coordinator_share': seconds[hostapp.kCoordinatorTime] / t_wall if t_wall else 0.0,
         },
         'database': db_figures,
+        'helper': None if helper is None else {
+            'files_scanned': len(helper.fScanned),
+            'scopes': sum(helper.fScanned.values()),
+            'up_to_date_sent_back': helper.fSentBackUpToDate,
+            'sent_back_busy': helper.fSentBackBusy,
+            'taken_from_local': helper.fTakenFromLocal,
+            'taken_back': helper.fHandedBack,
+            'gone': helper.fGoneReason,
+        },
         'remote': None if remote is None else {
             'latency': remote.fLatency,
             'inspect_failed': len(inspect_failed),

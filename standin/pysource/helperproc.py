@@ -52,7 +52,8 @@ from ostrelbase import destroyable, location
 from pysource import scopeinfo
 
 kPollMs = 5
-kDefaultDeadline = 30.0
+kDefaultDeadline = 30.0  # seconds a file may take
+kStartupDeadline = 60.0  # seconds the worker may take to get ready
 kPollBudget = 0.02  # seconds of result handling per poll
 kBackgroundPriority = 2
 kInteractivePriority = 1
@@ -108,6 +109,7 @@ class CHelperProcessSupport(destroyable.CDestroyable):
         self._fAnnounceIdle: Any = None
         self._fPollId: Any = None
         self._fLastProgress = 0.0
+        self._fReady = False  # the worker has built its host
 
     # -- life ------------------------------------------------------------------------
 
@@ -233,6 +235,8 @@ class CHelperProcessSupport(destroyable.CDestroyable):
             self._Emit('scan-queue-locs-added', locs)
 
     def _Emit(self, signal_name: str, locs: list[Any]) -> None:
+        if signal_name == 'scan-queue-locs-removed':
+            self._AnnounceNow()  # a listener sees a location added before it is removed
         if self.fHelperCallbackObj is not None:
             self.fHelperCallbackObj.emit(signal_name, self.fHelperCallbackObj, locs)
 
@@ -250,7 +254,13 @@ class CHelperProcessSupport(destroyable.CDestroyable):
                 if time.monotonic() - started > kPollBudget:
                     return True
         except (EOFError, OSError) as exc:
-            self._Gone(f'its pipe closed ({type(exc).__name__})')
+            proc = self.fProcess
+            if proc is not None:
+                proc.join(1.0)
+            if proc is not None and proc.exitcode is not None:
+                self._Gone(f'it exited (status {proc.exitcode})')
+            else:
+                self._Gone(f'its pipe closed ({type(exc).__name__})')
             return False
         except Exception as exc:  # noqa: BLE001 - an unreadable message: the worker is broken
             self._Gone(f'it sent an unreadable message ({type(exc).__name__})')
@@ -258,8 +268,9 @@ class CHelperProcessSupport(destroyable.CDestroyable):
         if self.fProcess is not None and not self.fProcess.is_alive():
             self._Gone(f'it exited (status {self.fProcess.exitcode})')
             return False
-        if self._fPending and time.monotonic() - self._fLastProgress > self.fDeadline:
-            self._Gone(f'no answer for {self.fDeadline:g} s')
+        deadline = self.fDeadline if self._fReady else max(self.fDeadline, kStartupDeadline)
+        if self._fPending and time.monotonic() - self._fLastProgress > deadline:
+            self._Gone(f'no answer for {deadline:g} s')
             return False
         if len(self._fPending) < self.fMaxBacklog:
             self._TakeFromLocalQueue(self.fMaxBacklog - len(self._fPending))
@@ -297,6 +308,9 @@ class CHelperProcessSupport(destroyable.CDestroyable):
         """Take in one message; False when it is not a well-formed result."""
         if not isinstance(message, tuple) or not message:
             return False
+        if message == ('ready',):
+            self._fReady = True
+            return True
         if message[0] == 'done' and len(message) == 5:
             _tag, url, mtime, infos, incomplete = message
             if not (isinstance(url, str) and isinstance(mtime, float | int)
@@ -389,6 +403,7 @@ def _WorkerMain(conn: Any, config: dict[str, Any]) -> None:
     ana_mgr = app.fAnaMgr
     cache_mgr = app.fSingletons.fCacheMgr
     scan_name = config['scan_name']
+    conn.send(('ready',))
     heap: list[tuple[int, int, str]] = []
     seq = 0
     while True:

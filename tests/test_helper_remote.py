@@ -173,8 +173,8 @@ def faulty_worker(conn, config, fault):
     ('kill', 'exited'), ('exit', 'exited'), ('garbage', 'not a result'),
     ('hang', 'no answer for 2 s')])
 def test_helper_gone_mid_scan_loses_nothing(tmp_path, fresh_loop, monkeypatch, fault, reason):
-    # The worker gets m0, m1 and m2 first; m1 is long, so it is being scanned when
-    # the worker is killed after m0.
+    # The worker gets m0, m1, ... first; m1 is long, so it is being scanned when the
+    # worker is killed after m0.
     root = make_tree(tmp_path / 'proj', n=8, big=1)
     local = run_job(root, tmp_path / 'local.sqlite')
     start = helperproc.CHelperProcessSupport.Start

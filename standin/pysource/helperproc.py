@@ -86,7 +86,7 @@ class CHelperProcessSupport(destroyable.CDestroyable):
     """The worker process and its bookkeeping (see the module note)."""
 
     def __init__(self, ana_mgr: Any, project_dir: str, deadline: float = kDefaultDeadline,
-                 max_backlog: int = 3, worker: Any = None, worker_args: tuple = ()) -> None:
+                 max_backlog: int = 8, worker: Any = None, worker_args: tuple = ()) -> None:
         super().__init__(())
         self.fAnaMgr = ana_mgr
         self.fProjectDir = project_dir

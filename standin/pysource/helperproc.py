@@ -285,6 +285,7 @@ class CHelperProcessSupport(destroyable.CDestroyable):
             return
         sq = coord._fScanQueue
         primary = self.fAnaMgr.fPrimaryScanName
+        cache = self.fAnaMgr.fInfoCache
         active = coord._CScanCoordinator__fActivePrimaryWholeFileScanners
         for single in reversed(list(sq._fOrderedQueues)):
             if count <= 0 or single.fScanName != primary or not len(single.fOrderedDict):
@@ -294,7 +295,8 @@ class CHelperProcessSupport(destroyable.CDestroyable):
                 if len(taken) >= count:
                     break
                 if (names == ['*'] and loc not in active and loc not in self._fPending
-                        and coord._CanSendToHelperProcess(loc, '*')):
+                        and coord._CanSendToHelperProcess(loc, '*')
+                        and cache.GetScanDoneTime(loc, primary) != loc.GetMTime()):
                     taken.append(loc)
             for loc in taken:
                 sq.RemoveScanTriple((loc, '*', primary), single.fPriority)

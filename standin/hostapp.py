@@ -43,6 +43,8 @@ class CApplication:
         self.fAnaMgr = ana_mgr
         self.fCoordinator: Any = None
         self.fSkippedEntries: list[tuple[str, str]] = []
+        self.fRemote: Any = None  # remoteproject.CRemoteProject when files are remote
+        self.fHelper: Any = None  # helperproc.CHelperProcessSupport when a helper runs
 
     def ProjectFiles(self, exclude: Iterable[str] = ()) -> list[location.CLocation]:
         """The project's files (recursively, hidden directories, ``__pycache__`` and

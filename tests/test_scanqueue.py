@@ -481,12 +481,27 @@ class TestRemoving:
         queue.AddScanPairs([(X, 'b')], S)
         queue.RemoveAllForLocations([X], {S})
         assert queue.LocationInQueue(X, T) and X in queue._fWaitingForInspectByLoc
-        # While X has parked work, removing a triple looks among the parked items only,
-        # so the ready scan survives; the parked entry goes as no scan was kept.
+        # The ready scan goes although X has parked work; the parked entry goes
+        # with it as no scan of X was kept.
         queue.RemoveAllForLocations([X], {T})
-        assert queue.LocationInQueue(X, T) and X not in queue._fWaitingForInspectByLoc
-        queue.RemoveAllForLocations([X], {T})
-        assert not queue.LocationInQueue(X)
+        assert not queue.LocationInQueue(X) and X not in queue._fWaitingForInspectByLoc
+        check_invariants(queue)
+
+    def test_completed_ready_scan_leaves_the_queue_while_other_work_is_parked(
+            self, impl, queue, data_cache):
+        data_cache.fReady.add(X)
+        queue.AddScanPairs([(X, 'a'), (X, 'c')], T, 1)
+        data_cache.MakeUnready([X])
+        queue.AddScanPairs([(X, 'b')], S)
+        parked = dict(queue._fWaitingForInspectByLoc)
+        data_cache.fReady.add(X)  # ready again; the release has not arrived yet
+        assert queue.First() == impl.CScanItem(X, 'a', T, 1)
+        queue.ScanCompleted(impl.CScanItem(X, 'a', T, 1))
+        assert queue.First() == impl.CScanItem(X, 'c', T, 1)
+        assert queue._fWaitingForInspectByLoc == parked
+        # Without a priority the matching ready scan is found and removed as well.
+        assert queue.RemoveScanTriple((X, 'c', T)) is True
+        assert not queue.LocationInQueue(X) and queue._fWaitingForInspectByLoc == parked
         check_invariants(queue)
 
 

@@ -2,7 +2,7 @@
 driven by the stand-in host application's main loop.
 
     ./run scan [DIR] [--db FILE] [--exclude NAME]... [--no-follow-stdlib]
-               [--plain | --quiet] [--json FILE]
+               [--plain | --quiet] [--json FILE] [--helper] [--remote-latency SECONDS]
 
 The host application is assembled for DIR (singletons, analysis manager,
 information cache, location data cache), the coordinator is created, every
@@ -37,12 +37,14 @@ import sys
 from pathlib import Path
 
 import hostapp
+import remoteproject
+import scanloop
 import scanreport
 from guiutils import ostrelgtk
-from ostrelbase import mime
+from ostrelbase import location, mime
 from rich.console import Console
 
-from pysource import infodb
+from pysource import helperproc, infodb
 
 ROOT = Path(__file__).resolve().parent.parent
 kExitWriteFailed = 1
@@ -151,7 +153,15 @@ def ParseArgs(argv: list[str]) -> argparse.Namespace:
     parser.add_argument('--json', metavar='FILE',
                         help="write the summary's figures as JSON to FILE ('-': standard "
                         'output, instead of the table)')
-    return parser.parse_args(argv)
+    parser.add_argument('--helper', action='store_true',
+                        help='scan whole files in a helper process as well')
+    parser.add_argument('--remote-latency', type=float, metavar='SECONDS',
+                        help="reach DIR's files through a remote agent answering after "
+                        'SECONDS')
+    args = parser.parse_args(argv)
+    if args.remote_latency is not None and not 0 <= args.remote_latency <= 60:
+        parser.error('--remote-latency: give a number of seconds from 0 to 60')
+    return args
 
 
 def main(argv: list[str]) -> int:
@@ -160,9 +170,14 @@ def main(argv: list[str]) -> int:
         root = CheckDirectory(args.dir)
         db = os.path.abspath(args.db) if args.db else DefaultDatabase(root)
         CheckDatabasePath(db)
-        app = hostapp.CreateApplication(
-            str(root), db_path=db, python_path=[str(root)] if args.no_follow_stdlib else None,
-            load_database=False)
+        python_path = [str(root)] if args.no_follow_stdlib else None
+        remote = None
+        if args.remote_latency is not None:
+            remote = remoteproject.CRemoteProject(str(root), args.remote_latency)
+            python_path = remote.PythonPath(not args.no_follow_stdlib)
+        app = hostapp.CreateApplication(str(root), db_path=db, python_path=python_path,
+                                        load_database=False)
+        app.fRemote = remote
         try:
             app.fAnaMgr.fInfoCache.LoadFromDatabase()
         except infodb.CDatabaseError as exc:
@@ -193,6 +208,16 @@ def Run(app: hostapp.CApplication, root: Path, db: str, args: argparse.Namespace
     try:
         coord = hostapp.CreateScanCoordinator(app, args.idle_priority)
         files = app.ProjectFiles(args.exclude)
+        outstanding = []
+        if app.fRemote is not None:
+            files = app.fRemote.Locations(files)
+            app.fRemote.Adopt(app.fAnaMgr)
+            outstanding.append(app.fRemote.Busy)
+        if args.helper:
+            app.fHelper = helperproc.CHelperProcessSupport(app.fAnaMgr, str(root))
+            app.fHelper.Start()
+            coord._UpdateForHelperProcess()
+            outstanding.append(app.fHelper.Busy)
         progress = scanreport.MakeProgress(console, args.plain, args.quiet or json_to_stdout)
         tracker = scanreport.CProgressTracker(app, coord, str(root), time.perf_counter())
 
@@ -206,7 +231,7 @@ def Run(app: hostapp.CApplication, root: Path, db: str, args: argparse.Namespace
         timing.Call(coord.AddParseablesToQueue, files)
         startup = ProcessAge()
         loop_started = time.perf_counter()
-        finished = ostrelgtk.run_until_idle(sys.maxsize, stop)
+        finished = scanloop.RunUntilDone(outstanding, stop)
         loop_seconds = time.perf_counter() - loop_started
         progress.Stop()
         if stop():
@@ -219,7 +244,11 @@ def Run(app: hostapp.CApplication, root: Path, db: str, args: argparse.Namespace
             summary['outcome'] = 'stopped'
     finally:
         timing.Uninstall()
+        if app.fHelper is not None:
+            app.fHelper.destroy()
         app.Shutdown()
+        if app.fRemote is not None:
+            app.fRemote.Close()
         stop.Uninstall()
     status = ExitStatus(summary)
     summary['exit_status'] = status
@@ -253,15 +282,19 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
     primary, derived = ana_mgr.fPrimaryScanName, ana_mgr.fDerivedScanName
     root_prefix = str(root).rstrip(os.sep) + os.sep
 
+    remote = getattr(app, 'fRemote', None)
+
     def in_project(loc: object) -> bool:
-        return getattr(loc, 'fPath', '').startswith(root_prefix)
+        return (getattr(loc, 'fPath', '').startswith(root_prefix)
+                and (remote is None or isinstance(loc, location.CRemoteFileLocation)))
 
     def name(loc: object) -> str:
         return scanreport.DisplayPath(getattr(loc, 'fPath', None) or loc.fUrl, str(root))
 
     scans = {'primary_whole_file': 0, 'primary_single_scope': 0,
              'derived_whole_file': 0, 'derived_single_scope': 0}
-    scanned = set()
+    helper = getattr(app, 'fHelper', None)
+    scanned = set(helper.fScanned) if helper is not None else set()
     for (loc, scope, scan_name), n in coord._fScanTripleCompletedCount.items():
         kind = 'primary' if scan_name == primary else 'derived' if scan_name == derived else None
         if kind is None:
@@ -269,6 +302,8 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
         scans[f"{kind}_{'whole_file' if scope == '*' else 'single_scope'}"] += n
         if kind == 'primary':
             scanned.add(loc)
+    if helper is not None:
+        scans['primary_whole_file'] += len(helper.fScanned)
     scans['total'] = sum(scans.values())
     problems = app.fSingletons.fCacheMgr.fReadProblems
     scanned.difference_update(problems)  # abandoned: the coordinator counts them as done
@@ -280,9 +315,13 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
     python = [loc for loc, m in mimes.items() if m in mime.kAnalyzableMimeTypes]
     failed = [{'path': name(loc), 'kind': kind, 'detail': detail}
               for loc, (kind, detail) in problems.items()]
+    inspect_failed = remote.fInspectFailed if remote is not None else set()
+    failed += [{'path': name(loc), 'kind': 'inspect-failed',
+                'detail': 'the remote agent could not inspect it; its scans stay parked'}
+               for loc in inspect_failed]
     not_reached = 0
     for loc in python:
-        if loc in scanned or loc in up_to_date or loc in problems:
+        if loc in scanned or loc in up_to_date or loc in problems or loc in inspect_failed:
             continue
         if not loc.GetStat().exists:
             failed.append({'path': name(loc), 'kind': 'vanished',
@@ -344,6 +383,20 @@ def CollectSummary(app: hostapp.CApplication, coord: object, timing: hostapp.CHo
             'coordinator_share': seconds[hostapp.kCoordinatorTime] / t_wall if t_wall else 0.0,
         },
         'database': db_figures,
+        'helper': None if helper is None else {
+            'files_scanned': len(helper.fScanned),
+            'scopes': sum(helper.fScanned.values()),
+            'up_to_date_sent_back': helper.fSentBackUpToDate,
+            'sent_back_busy': helper.fSentBackBusy,
+            'taken_from_local': helper.fTakenFromLocal,
+            'taken_back': helper.fHandedBack,
+            'gone': helper.fGoneReason,
+        },
+        'remote': None if remote is None else {
+            'latency': remote.fLatency,
+            'inspect_failed': len(inspect_failed),
+            'parked_scans': coord._fScanQueue.GetWaitingCount(),
+        },
         'peak_rss_bytes': resource.getrusage(resource.RUSAGE_SELF).ru_maxrss * 1024,
     }
 

@@ -116,6 +116,11 @@ class CProgressTracker:
             rows.append(CQueueRow(ScanLabel(ana_mgr, name), sum(finished.get(name, (0, 0))),
                                   left, detail))
         rows.append(CQueueRow('waiting for data', None, status.waiting_count))
+        helper = getattr(self.fApp, 'fHelper', None)
+        if helper is not None:
+            rows.append(CQueueRow('in the helper process', len(helper.fScanned),
+                                  len(helper._fPending),
+                                  f'gone: {helper.fGoneReason}' if helper.fGoneReason else ''))
         done = sum(sum(v) for v in finished.values())
         left = sum(r.left for r in rows)
         history = self._fHistory
@@ -297,6 +302,19 @@ def PrintSummary(console: Console, s: dict[str, Any]) -> None:
         table.add_row('', f"{db['files']:,} files, {db['scopes']:,} scopes, "
                       f"{FormatBytes(db['bytes'])} ({FormatBytes(db['bytes_per_file'])} per file, "
                       f"{db['bytes_per_scope']:,.0f} B per scope)")
+    helper = s.get('helper')
+    if helper:
+        table.add_row('helper process', f"{helper['files_scanned']:,} files scanned "
+                      f"({helper['scopes']:,} scopes), {helper['taken_from_local']:,} taken from "
+                      f"the local queue, {helper['sent_back_busy']:,} left to it while busy")
+        if helper['gone']:
+            table.add_row('', Text(f"gone: {helper['gone']}; {helper['taken_back']:,} unfinished "
+                                   'files taken back into the local queue', style='yellow'))
+    remote = s.get('remote')
+    if remote:
+        table.add_row('remote files', f"latency {remote['latency']:g} s, "
+                      f"{remote['inspect_failed']:,} failed inspections, "
+                      f"{remote['parked_scans']:,} scans left parked")
     table.add_row('peak memory', FormatBytes(s['peak_rss_bytes']))
     console.print(table)
     if s['outcome'] == 'interrupted':

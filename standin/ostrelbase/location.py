@@ -15,7 +15,13 @@ interchangeable as dictionary keys.
 
 The inspection state of remote locations lives in this module (``_gInspections``)
 so that ``IsReady()`` needs no other object.  ``_WaitForInspectMultiple`` starts
-inspections and calls back once every location of a request is inspected.
+inspections and calls back once every location of a request is inspected.  An
+inspection that the agent cannot complete for one file (it cannot read it) leaves
+that file uninspected and ends its waits with ``abort``.
+
+A remote file's contents are a second round trip: ``_WaitForData`` inspects the
+file if needed, then fetches its contents, which ``ReadBytes`` hands out once
+(later reads go to the agent directly).  Scanners wait for the data this way.
 """
 from __future__ import annotations
 
@@ -44,6 +50,8 @@ class CStatInfo(NamedTuple):
 
 
 kMissingStat = CStatInfo(False, False, 0.0, 0, False)
+# What an agent answers for a file it cannot inspect (it exists but cannot be read).
+kInspectFailed = CStatInfo(False, False, -1.0, -1, False)
 
 
 class CLocation:
@@ -180,6 +188,9 @@ class CRemoteFileLocation(CLocation):
     def ReadBytes(self) -> bytes:
         if not self.IsReady():
             raise CNotReadyError(f'{self.fUrl} has not been inspected')
+        data = _gInspections.TakeData(self)
+        if data is not None:
+            return data
         server = _GetServer(self.fHost)
         if server is None:
             raise CNotReadyError(f'no remote agent for {self.fHost!r}')
@@ -232,6 +243,8 @@ class _CInspections:
         self._fStats: dict[CRemoteFileLocation, CStatInfo] = {}
         self._fInFlight: set[CRemoteFileLocation] = set()
         self._fWaiters: list[_CWaiter] = []
+        self._fData: dict[CRemoteFileLocation, bytes] = {}
+        self._fDataWaiters: dict[CRemoteFileLocation, list[Callable[[bool], Any]]] = {}
 
     def GetStat(self, loc: CRemoteFileLocation) -> CStatInfo | None:
         return self._fStats.get(loc)
@@ -240,9 +253,41 @@ class _CInspections:
         """Drop inspection results (of one host, or all)."""
         if host is None:
             self._fStats.clear()
+            self._fData.clear()
         else:
-            for loc in [loc for loc in self._fStats if loc.fHost == host]:
-                del self._fStats[loc]
+            for table in (self._fStats, self._fData):
+                for loc in [loc for loc in table if loc.fHost == host]:
+                    del table[loc]
+
+    def HasData(self, loc: CRemoteFileLocation) -> bool:
+        return loc in self._fData
+
+    def TakeData(self, loc: CRemoteFileLocation) -> bytes | None:
+        return self._fData.pop(loc, None)
+
+    def WaitForData(self, loc: CRemoteFileLocation, callback: Callable[[bool], Any]) -> None:
+        """``callback(abort)`` once the contents of ``loc`` have arrived."""
+        if loc in self._fData:
+            callback(False)
+            return
+        waiters = self._fDataWaiters.setdefault(loc, [])
+        waiters.append(callback)
+        if len(waiters) > 1:
+            return  # a fetch is in flight
+
+        def done(results: dict[str, bytes | None], abort: bool) -> None:
+            data = None if abort else results.get(loc.fPath)
+            if data is not None:
+                self._fData[loc] = data
+            for waiter in self._fDataWaiters.pop(loc, []):
+                waiter(data is None)
+
+        server = _GetServer(loc.fHost)
+        if server is None:
+            from guiutils import ostrelgtk
+            ostrelgtk.idle_add(lambda: done({}, True))
+            return
+        server.RequestRead([loc.fPath], done)
 
     def Wait(self, locs: list[CRemoteFileLocation], callback: Callable[[bool], Any],
              force: bool) -> None:
@@ -275,16 +320,22 @@ class _CInspections:
 
     def _Completed(self, locs: list[CRemoteFileLocation],
                    results: dict[str, CStatInfo | None], abort: bool) -> None:
+        failed = set()
         for loc in locs:
             self._fInFlight.discard(loc)
-            if not abort:
-                self._fStats[loc] = results.get(loc.fPath) or kMissingStat
+            if abort:
+                continue
+            st = results.get(loc.fPath) or kMissingStat
+            if st == kInspectFailed:
+                failed.add(loc)  # stays uninspected
+            else:
+                self._fStats[loc] = st
         finished = []
         for waiter in self._fWaiters:
             hit = waiter.fRemaining.intersection(locs)
             if hit:
                 waiter.fRemaining.difference_update(hit)
-                waiter.fAbort = waiter.fAbort or abort
+                waiter.fAbort = waiter.fAbort or abort or not failed.isdisjoint(hit)
                 if not waiter.fRemaining:
                     finished.append(waiter)
         # Bookkeeping is complete before any callback runs: a callback may start
@@ -313,6 +364,26 @@ def _WaitForInspectMultiple(loc_seq: Iterable[Any], callback: Callable[[bool], A
         callback(False)
         return
     _gInspections.Wait(need, callback, force)
+
+
+def HasData(loc: Any) -> bool:
+    """Whether the contents of ``loc`` are at hand (always, for a local file)."""
+    return not IsAsyncInspectLocation(loc) or _gInspections.HasData(loc)
+
+
+def _WaitForData(loc: Any, callback: Callable[[bool], Any]) -> None:
+    """Call ``callback(abort)`` once ``loc`` is inspected and its contents arrived;
+    at once when they are at hand."""
+    if HasData(loc):
+        callback(False)
+        return
+
+    def inspected(abort: bool) -> None:
+        if abort:
+            callback(True)
+        else:
+            _gInspections.WaitForData(loc, callback)
+    _WaitForInspectMultiple([loc], inspected, False)
 
 
 def ForgetInspections(host: str | None = None) -> None:

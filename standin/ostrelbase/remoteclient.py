@@ -1,8 +1,11 @@
 """Remote agents: servers that hold files of another machine.
 
 The stand-in agent serves a local directory tree under a host name.  Requests
-for file status complete asynchronously, from the main loop, after the agent's
-latency; reading a file is synchronous once its location has been inspected.
+for file status and for file contents complete asynchronously, from the main
+loop, after the agent's latency; reading a file is also possible synchronously
+once its location has been inspected.  The agent honours the permission bits of
+the files it serves: a file without read permission cannot be inspected (its
+status request answers ``kInspectFailed``), even when this process runs as root.
 Stopping an agent aborts its requests in flight and emits "server-stopped", also
 as a class-wide signal that any listener can follow with
 ``CRemoteServerManager.class_connect_while_alive``.
@@ -11,13 +14,14 @@ from __future__ import annotations
 
 import os
 import posixpath
+import stat
 from collections.abc import Callable
 from typing import Any
 
 from guiutils import ostrelgtk
 
 from ostrelbase import destroyable
-from ostrelbase.location import CStatInfo, ForgetInspections
+from ostrelbase.location import CStatInfo, ForgetInspections, kInspectFailed
 
 StatCallback = Callable[[dict[str, CStatInfo | None], bool], Any]
 
@@ -33,7 +37,7 @@ class CAgentServerBase(destroyable.CDestroyable):
         self.fRootDir = os.path.abspath(root_dir)
         self.fLatencyMs = latency_ms
         self.fRunning = False
-        self._fRequests: dict[int, tuple[list[str], StatCallback]] = {}
+        self._fRequests: dict[int, tuple[list[str], Callable[[dict, bool], Any]]] = {}
 
     def Start(self) -> None:
         if not self.fRunning:
@@ -67,15 +71,41 @@ class CAgentServerBase(destroyable.CDestroyable):
         return os.path.join(self.fRootDir, *[p for p in rel.split('/') if p])
 
     def StatNow(self, path: str) -> CStatInfo | None:
+        """The status of ``path``: None when it does not exist, ``kInspectFailed``
+        when it exists but cannot be read."""
         local = self.MapPath(path)
         try:
             st = os.stat(local)
+        except (FileNotFoundError, NotADirectoryError):
+            return None
+        except OSError:
+            return kInspectFailed
+        is_dir = stat.S_ISDIR(st.st_mode)
+        if not is_dir and not st.st_mode & 0o444:
+            return kInspectFailed
+        return CStatInfo(True, is_dir, st.st_mtime, st.st_size, stat.S_ISREG(st.st_mode))
+
+    def ReadNow(self, path: str) -> bytes | None:
+        """The contents of ``path``, None when it cannot be read."""
+        if self.StatNow(path) in (None, kInspectFailed):
+            return None
+        try:
+            return self.ReadFile(path)
         except OSError:
             return None
-        return CStatInfo(True, os.path.isdir(local), st.st_mtime, st.st_size)
 
     def RequestStat(self, paths: list[str], callback: StatCallback) -> None:
         """Ask for the status of ``paths``; ``callback(results, abort)`` runs later."""
+        self._Request(paths, callback, self.StatNow)
+
+    def RequestRead(self, paths: list[str],
+                    callback: Callable[[dict[str, bytes | None], bool], Any]) -> None:
+        """Ask for the contents of ``paths``; ``callback(results, abort)`` runs later
+        (None for a file that could not be read)."""
+        self._Request(paths, callback, self.ReadNow)
+
+    def _Request(self, paths: list[str], callback: Callable[[dict, bool], Any],
+                 answer: Callable[[str], Any]) -> None:
         if not self.fRunning:
             ostrelgtk.idle_add(lambda: callback({}, True))
             return
@@ -84,7 +114,7 @@ class CAgentServerBase(destroyable.CDestroyable):
 
         def reply() -> bool:
             self._fRequests.pop(sid_holder[0], None)
-            callback({p: self.StatNow(p) for p in paths}, False)
+            callback({p: answer(p) for p in paths}, False)
             return False
 
         if self.fLatencyMs > 0:

@@ -19,9 +19,11 @@ file's scopes at the end; a single-scope scan stores only when asked
 Secondary scanners derive information from what the primary scan stored: what
 each name resolves to (``inferencer``).  They store their results themselves.
 
-Remote files: a scanner whose location is not inspected yet asks for inspection,
-returns ``kWaitingForData`` and, when the data arrives (or the agent gives up),
-emits "scan-state-changed" with itself as argument.
+Remote files: a scanner whose location's contents are not at hand asks for them
+(inspecting the location first if needed), returns ``kWaitingForData`` and, when
+the data arrives (or the agent gives up), emits "scan-state-changed" with itself
+as argument.  A scan whose data could not be had is abandoned and the file is
+listed among the cache manager's read problems.
 """
 from __future__ import annotations
 
@@ -463,10 +465,14 @@ class CScanner(destroyable.CDestroyable):
     def _NeedsData(self) -> bool:
         """Whether the location's data must first arrive; starts waiting for it."""
         loc = self.fLocation
-        if not location.IsAsyncInspectLocation(loc) or loc.IsReady():
+        if not location.IsAsyncInspectLocation(loc) or location.HasData(loc):
             return False
-        location._WaitForInspectMultiple([loc], self._CB_DataArrived, False)
-        if loc.IsReady():  # answered at once
+        if loc.IsReady() and not loc.GetStat().is_file:
+            return False  # nothing to fetch; reading it reports why
+        if singleton.GetSingletons().fCacheMgr.DoesCacheBufferExist(loc, True) is not None:
+            return False  # scanned from its open buffer
+        location._WaitForData(loc, self._CB_DataArrived)
+        if location.HasData(loc):  # answered at once
             return False
         self.fState = kWaitingForData
         return True
@@ -474,6 +480,9 @@ class CScanner(destroyable.CDestroyable):
     def _CB_DataArrived(self, abort: bool) -> None:
         if self._fDestroyed or self.fState != kWaitingForData:
             return
+        if abort:
+            problems = singleton.GetSingletons().fCacheMgr.fReadProblems
+            problems[self.fLocation] = ('unreadable', 'remote data could not be had')
         self._fWaitAborted = bool(abort)
         self.fState = kScanAbandoned if abort else kReadyToScan
         self.emit('scan-state-changed', self)

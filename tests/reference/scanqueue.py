@@ -317,7 +317,13 @@ class _CScanQueue(destroyable.CDestroyable):
             waiting_items.difference_update(to_remove)
             if not waiting_items:
                 self._fWaitingForInspectByLoc.pop(loc, None)
-            return len(to_remove) > 0
+            # The location may have a ready scan as well: it leaves the ready
+            # queue too, and the parked work stays parked.
+            ready_removed = self._RemoveReadyScan(loc, scope_name, scan_name, priority)
+            return len(to_remove) > 0 or ready_removed
+        return self._RemoveReadyScan(loc, scope_name, scan_name, priority)
+
+    def _RemoveReadyScan(self, loc, scope_name, scan_name, priority):
         if priority is None:
             priority = self._FindScanPriority(loc, scope_name, scan_name)
             if priority is None:

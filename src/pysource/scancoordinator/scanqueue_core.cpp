@@ -700,6 +700,14 @@ bool RemoveScanFromPerLocationMap(Q *q, Borrowed loc, Borrowed scope, Borrowed s
   return remove_from_per_location_map(q, loc, scan_name, priority, k, info);
 }
 
+namespace {
+
+// Takes one scan out of the single queues and the per-location records.
+bool remove_ready_scan(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                       Borrowed key, const LocInfo *known);
+
+} // namespace
+
 bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
                       bool remove_waiting, Borrowed key, const LocInfo *known) {
   Ref waiting = q->f._fWaitingForInspectByLoc;
@@ -733,9 +741,20 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
           py::throw_error();
         Ref popped = py::check(PyObject_CallMethod(waiting.get(), "pop", "OO", loc.get(), Py_None));
       }
-      return !to_remove.empty();
+      // A location with parked work may also have ready scans (queued after
+      // its branch became ready, or resumed after waiting for data): the
+      // matching one leaves the ready queue too, the parked work stays.
+      const bool ready_removed = remove_ready_scan(q, loc, scope, scan_name, priority, key, known);
+      return !to_remove.empty() || ready_removed;
     }
   }
+  return remove_ready_scan(q, loc, scope, scan_name, priority, key, known);
+}
+
+namespace {
+
+bool remove_ready_scan(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Borrowed priority,
+                       Borrowed key, const LocInfo *known) {
   Ref prio;
   if (priority && !priority.is_none()) {
     prio = priority.ref();
@@ -780,6 +799,8 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   }
   return false;
 }
+
+} // namespace
 
 void RemoveAllForLocation(Q *q, Borrowed loc_b, Borrowed scan_name_set, bool remove_waiting) {
   const bool all_names = !scan_name_set || scan_name_set.is_none();

@@ -3,20 +3,16 @@
 `QueueMachine` drives random sequences of queue operations, host signals and
 main-loop runs.  After every step it checks, by reading the queue's fields,
 the structural invariants and that the queued, parked and waiting scans are
-exactly those a small model predicts.  Run with both implementations, it also
-checks that the compiled queue and the pure-Python one give equal results,
-fields and signals for the same operations.
+exactly those a small model predicts.  It runs the compiled queue beside the
+pure-Python reference queue and checks that both give equal results, fields
+and signals for the same operations.
 
 The default run is kept short; set SCANQUEUE_PROPERTY_EXAMPLES (for example
 to 2000) for a longer search.
 """
-import pytest
-
-# check_invariants() and friends assert; have pytest explain their failures.
-pytest.register_assert_rewrite('scanqueue_fixtures')
-
 import os
 
+import pytest
 import singleton
 from doubles import AsyncLocation, FakeLocationDataCache, LocalLocation, SignalRecorder
 from guiutils import ostrelgtk
@@ -30,8 +26,9 @@ from hypothesis.stateful import (
     rule,
     run_state_machine_as_test,
 )
-from scanqueue_fixtures import *  # fixtures
-from scanqueue_fixtures import S, T, check_invariants, kOrders, load_impl, make_queue, snapshot
+from queue_helpers import *
+
+pytestmark = pytest.mark.usefixtures('async_probe')
 
 kExamples = int(os.environ.get('SCANQUEUE_PROPERTY_EXAMPLES', '0')) or None
 
@@ -262,10 +259,10 @@ class QueueModel:
 
 
 class QueueMachine(RuleBasedStateMachine):
-    """Subclasses set `impl_names`; the first implementation is the one under test,
-    any further ones must agree with it step by step."""
+    """The compiled queue under test, and the reference queue that must agree with it
+    step by step."""
 
-    impl_names = ('reference',)
+    impl_names = ('compiled', 'reference')
 
     def __init__(self):
         super().__init__()
@@ -514,20 +511,8 @@ class QueueMachine(RuleBasedStateMachine):
         self.present = present
 
 
-class ReferenceMachine(QueueMachine):
-    impl_names = ('reference',)
-
-
-class CompiledMachine(QueueMachine):
-    impl_names = ('compiled', 'reference')
-
-
-def test_reference_queue_follows_the_model():
-    run_state_machine_as_test(ReferenceMachine, settings=_machine_settings(500, 50))
-
-
-def test_compiled_queue_follows_the_model_and_the_reference():
-    run_state_machine_as_test(CompiledMachine, settings=_machine_settings(500, 50))
+def test_queue_follows_the_model_and_the_reference():
+    run_state_machine_as_test(QueueMachine, settings=_machine_settings(500, 50))
 
 
 # ----------------------------------------------------------------------

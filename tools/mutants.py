@@ -45,7 +45,7 @@ ROOT = Path(__file__).resolve().parent.parent
 MUTATED = ROOT / "src" / "pysource"
 OUT = ROOT / "build" / "mutants"
 VENV = ROOT / ".venv" / "bin"
-SNAPSHOT = ["src", "CMakeLists.txt", "pyproject.toml", "tests", "standin"]
+SNAPSHOT = ["src", "CMakeLists.txt", "pyproject.toml", "tests", "standin", "bench"]
 TARGET = "scancoordinator"
 
 # ---- finding candidate changes ----------------------------------------------------

@@ -1,19 +1,12 @@
 """Scripted stand-ins for the scan coordinator's collaborators.
 
-Every double writes the calls made on it into one shared `CallLog`, so a test
-can check the order of calls across collaborators as well as their arguments.
-Answers come from plain attributes the test sets; a double can be told to raise
-from one operation (`Fail`) or to run a probe while it is called (`Probe`).
-Signal emitters derive from the host's CDestroyable, so the coordinator connects
-to them exactly as it does in the application.
-
-The coordinator creates its scanners by looking the classes up on
-`pysource.scopescanner` each time; `Host.Patch` replaces them with scripted
-scanners that answer their `Scan(end_time)` calls from a script registered for
-their location (whole-file kinds) or (location, scope name) pair: a state, an
-exception instance to raise, or a callable `fn(scanner, end_time)` returning
-the state; the last entry repeats.  It also makes the coordinator's logger a
-`RecordingLogger` and records `reflect.ReportCurrentException`.
+Every double records its calls in one shared `CallLog` (so a test can check the
+order of calls across collaborators), answers from attributes the test sets,
+and can be told to raise (`Fail`) or to run a probe when called (`Probe`).
+`Host.Patch` replaces the scanner classes the coordinator looks up on
+`pysource.scopescanner` with scripted ones (each `Scan` answers the next entry of
+its script: a state, an exception to raise, or `fn(scanner, end_time)`; the last
+repeats), the logger with a `RecordingLogger`, and the exception reporter.
 """
 import collections
 import io
@@ -30,43 +23,13 @@ from ostrelutils import reflect
 
 from pysource import _fastaccess, analysis, scancoordinator, scopeinfo, scopescanner, symbolinfo
 
-__all__ = [
-    'DERIVED',
-    'IDLE_PRIORITY',
-    'PRIMARY',
-    'PRIMARY_SCOPE',
-    'PRIMARY_WHOLE',
-    'SECONDARY_SCOPE',
-    'SECONDARY_WHOLE',
-    'Analysis',
-    'Boom',
-    'CScanCoordinator',
-    'CScanItem',
-    'FileAttribMgr',
-    'Host',
-    'active',
-    'add_incomplete',
-    'class_def',
-    'data_waiting',
-    'end_in',
-    'helper_callback_class',
-    'kFinishedScanning',
-    'kReadyToScan',
-    'kScanAbandoned',
-    'kTimedOut',
-    'kWaitingForData',
-    'local',
-    'make_coord',
-    'method_def',
-    'pending_callbacks',
-    'queued',
-    'record_signals',
-    'remote',
-    'scope_info',
-    'signals_of',
-    'take_over_idle',
-    'waiting',
-]
+__all__ = ['DERIVED', 'IDLE_PRIORITY', 'PRIMARY', 'PRIMARY_SCOPE', 'PRIMARY_WHOLE',
+           'SECONDARY_SCOPE', 'SECONDARY_WHOLE', 'Analysis', 'Boom', 'CScanCoordinator',
+           'CScanItem', 'FileAttribMgr', 'Host', 'active', 'add_incomplete', 'class_def',
+           'data_waiting', 'end_in', 'helper_callback_class', 'kFinishedScanning', 'kReadyToScan',
+           'kScanAbandoned', 'kTimedOut', 'kWaitingForData', 'local', 'make_coord', 'method_def',
+           'pending_callbacks', 'queued', 'record_signals', 'remote', 'scope_info', 'signals_of',
+           'take_over_idle', 'waiting']
 
 PRIMARY = 'scope-primary'
 DERIVED = 'scope-derived'
@@ -124,8 +87,6 @@ class Scripted:
         if self.fFailures.get(what) is not None:
             raise self.fFailures[what]
 
-
-# ---- scripted scanners -------------------------------------------------------------
 
 PRIMARY_WHOLE, PRIMARY_SCOPE = 'CWholeFilePrimaryScanner', 'CSingleScopePrimaryScanner'
 SECONDARY_WHOLE, SECONDARY_SCOPE = 'CWholeFileSecondaryScanner', 'CSingleScopeSecondaryScanner'
@@ -233,8 +194,6 @@ class ScannerKit:
         [made] = self.Made(kind)
         return made
 
-
-# ---- the information cache and the services around it ---------------------------------
 
 def scope_info(loc, scope_name, type_equivs=None, def_info=b'', mtime=100.0):
     key = scopeinfo.CScopeInfoKey(loc, scope_name, PRIMARY, loc, scope_name)
@@ -482,8 +441,6 @@ class AnaMgr(SimpleNamespace):
     """The analysis manager: scan names, services, Python path, helper process."""
 
 
-# ---- the host --------------------------------------------------------------------------
-
 class Host:
     """One set of collaborators for a coordinator, sharing one call log."""
 
@@ -560,8 +517,6 @@ def coord(host):
     if not c._CDestroyable__fDestroyed:
         c.destroy()
 
-
-# ---- observing the coordinator ---------------------------------------------------------------
 
 def queued(coord):
     """Every ready scan: {(loc, scope, scan name): priority}."""

@@ -1,12 +1,9 @@
 """CScanCoordinator: following the helper process (`_UpdateForHelperProcess`).
 Taking work back when the helper is gone, handing queued whole-file primary
 scans to a new one, its two class-wide signals, and the end of the connections."""
-import gc
-import weakref
 from types import SimpleNamespace
 
 import pytest
-import singleton
 from coord_doubles import *
 from guiutils import ostrelgtk
 from ostrelbase import destroyable
@@ -28,16 +25,18 @@ def helper_calls(host):
 
 def test_work_recorded_in_a_gone_helper_is_queued_again(coord, host):
     coord._fLocsQueuedInHelper.update({A, B, C})
+    host.UseHelper()
+    coord._UpdateForHelperProcess()  # the helper still runs: its work stays there
+    assert coord._fLocsQueuedInHelper == {A, B, C} and coord._fIdleProcId is None
+    host.UseHelper(False)
     assert coord._UpdateForHelperProcess() is None
     assert coord._fLocsQueuedInHelper == set()
     assert queued(coord) == {(loc, '*', PRIMARY): 2 for loc in (A, B, C)}
-    assert len(pending_callbacks(coord)) == 1 and helper_calls(host) == []
-    # Nothing recorded and no callback object: nothing happens.
-    host.UseHelper()
+    assert len(pending_callbacks(coord)) == 1 and host.fLog == []
+    coord._CancelIdle()
     install_callback_obj(host, None)
-    host.fLog.clear()
-    coord._UpdateForHelperProcess()
-    assert host.fLog == [] and coord._fHelperCallbackObjConnected is None
+    coord._UpdateForHelperProcess()  # nothing recorded, no callback object: nothing
+    assert coord._fIdleProcId is None and coord._fHelperCallbackObjConnected is None
 
 
 def test_work_taken_back_during_a_scan_gets_the_scans_priority(coord, host):
@@ -165,10 +164,4 @@ def test_destroying_the_coordinator_ends_the_class_wide_connections():
     reporter = Callbacks()
     reporter.emit(ADDED, reporter, [A])
     assert c._fLocsQueuedInHelper == set()
-    ref = weakref.ref(c)
-    Callbacks.fConnects.clear()
     h.Destroy()
-    singleton.ResetSingletons()
-    del c, h
-    gc.collect()
-    assert ref() is None

@@ -2,6 +2,7 @@
 constructor, idle scheduling, suspension, quitting and destruction."""
 import gc
 import weakref
+from types import SimpleNamespace
 
 import config
 import pytest
@@ -11,42 +12,25 @@ from coord_doubles import *
 from guiutils import ostrelgtk
 from ostrelbase import containers, destroyable, remoteclient
 
-from pysource import _fastaccess, analysis, scancoordinator
+from pysource import _fastaccess, analysis
 
 A, B, C = local('a.py'), local('b.py'), local('c.py')
 R = remote('r.py')  # never made ready: its scans wait for inspection
 P = '_CScanCoordinator__'
 
 
-# ---- construction and fields ------------------------------------------------------------
-
-def test_initial_fields(coord, host):
+def test_fields(coord, host):
     assert (coord.fAnaMgr, coord._fInfoCache, coord._fInferenceEngine, coord.fCacheMgr) == (
         host.fAnaMgr, host.fInfoCache, host.fEngine, host.fCacheMgr)
-    assert coord.fSingletons is singleton.GetSingletons()
-    assert type(coord._fScanQueue) is scancoordinator._CScanQueue
     assert coord._fScanQueue._fLocationDataCache is host.fDataCache
     assert type(coord.fLog) is _fastaccess.CLogger and coord.fLog.fCategory == 'IdleAnalysis'
-    values = {name: getattr(coord, name) for name in (
-        f'{P}fActiveLoc', f'{P}fActivePrimaryWholeFileScanners', f'{P}fCompletedLocs',
-        f'{P}fStatusTimeout', f'{P}fQuitting', '_fCompletedScanCount', '_fIdleProcId',
-        '_fMTimeAtLastWholeFileCheck', 'fIdlePriority', '_fLastScanCompleted',
-        '_fAllBasicModuleQueued', '_fAnalyzeFoundImports', '_fRemoteLocationsReady',
-        '_fActiveScanNowTriples', '_fPendingScanNowTriples', 'fActiveScanItem',
-        '_fActiveIdleStart', '_fLastLogQueue', 'fWaitingForRemote', '_fLocsQueuedInHelper',
-        '_fIdleToWriteToDatabase', '_fHelperCallbackObjConnected', '_fIdleScanSuspendCount')}
-    assert values == dict(zip(values, (
-        None, {}, set(), None, False, {}, None, {}, IDLE_PRIORITY, {}, False, True, set(),
-        set(), set(), None, -1.0, -1.0, False, set(), None, None, 0), strict=True))
     # Both defaulting dictionaries make and keep an entry for a missing key.
     assert coord._fIncompleteScansByLoc[A] == set() and A in coord._fIncompleteScansByLoc
     assert coord._fScanTripleCompletedCount[(A, '*', PRIMARY)] == 0
-
-
-def test_fields_are_read_only_but_one(coord):
     for name in ('fAnaMgr', '_fScanQueue', '_fIdleProcId', f'{P}fQuitting', 'fLog'):
         with pytest.raises(AttributeError):
             setattr(coord, name, None)
+def test_found_imports_flag_is_writable(coord):
     for value, expected in ((0, False), ('yes', True), ([], False)):
         coord._fAnalyzeFoundImports = value
         assert coord._fAnalyzeFoundImports is expected
@@ -84,8 +68,6 @@ def test_an_info_cache_of_another_type_is_rejected(host, bad, exc):
     # A wrong type is rejected before the scan queue connects to the data cache.
     assert bool(host.fDataCache._CDestroyable__fSignalCatchers) is (exc is AttributeError)
 
-
-# ---- quitting, scheduling, suspension ------------------------------------------------------------
 
 def test_quitting_is_one_way_and_leaves_the_idle_alone(coord):
     coord._ScheduleIdle()
@@ -165,8 +147,6 @@ def test_resume_counts_helper_work_but_not_waiting_work(coord, host):
     assert coord._fIdleProcId is not None
 
 
-# ---- the constructor's signal handlers ------------------------------------------------------------
-
 def seed_last_scans(coord, *locs):
     for i, loc in enumerate(locs):
         coord._fLastScanCompleted[loc] = {('*', PRIMARY): 100.0 + i}
@@ -241,9 +221,12 @@ def test_import_resolution_changes(coord, host):
     assert coord._fIdleProcId is not None
 
 
-# ---- destruction --------------------------------------------------------------------------------
-
-def test_destroy_cancels_the_idle_and_the_status_timeout_and_destroys_the_queue(coord, host):
+def test_destroy_cancels_the_idle_and_the_status_timeout_and_destroys_the_queue(
+        coord, host, monkeypatch):
+    removed = []
+    real = ostrelgtk.timeout_remove
+    monkeypatch.setattr(ostrelgtk, 'timeout_remove', lambda sid: removed.append(sid) or real(sid))
+    make_coord(host).destroy()  # no status timeout: nothing to remove
     coord.AddPairsToPrimaryQueue([(A, 'f'), (B, '*')])
     coord._CScanCoordinator__EnsureStatusTimeout()
     tid = coord._CScanCoordinator__fStatusTimeout
@@ -252,7 +235,7 @@ def test_destroy_cancels_the_idle_and_the_status_timeout_and_destroys_the_queue(
     assert coord.destroy() is None
     assert pending_callbacks(coord) == [] and coord._fIdleProcId is None
     assert [(c.what, c.kwargs['state']) for c in host.fLog] == [('end', None)]
-    assert not ostrelgtk.GetMainLoop().has_source(tid)
+    assert removed == [tid] and not ostrelgtk.GetMainLoop().has_source(tid)
     assert q._CDestroyable__fDestroyed and q._fPerLocationInfo == {}
     host.fDataCache.MakeReady([R])  # the queue no longer listens
     assert coord._fScanQueue is q and q._fPerLocationInfo == {}
@@ -281,18 +264,33 @@ def test_destroy_ends_the_owned_connections_only(coord, host, tmp_path):
     server.destroy()
 
 
-def test_a_coordinator_held_by_its_analysis_manager_is_freed():
-    h = Host()
+def test_a_destroyed_coordinator_in_reference_cycles_is_freed(monkeypatch):
+    """Cycles through its analysis manager, its active scanners' handlers (a primary
+    scan waiting for data, an unfinished secondary scan) and the helper's callbacks."""
+    h = Host().Patch(monkeypatch)
+    Callbacks = helper_callback_class()
+    h.fAnaMgr._fHelperProcessSupport = SimpleNamespace(fHelperCallbackObj=Callbacks())
+    h.UseHelper()
     c = make_coord(h)
     h.fAnaMgr.fScanCoordinator = c
-    c.AddPairsToPrimaryQueue([(A, 'f'), (B, '*')])
-    c.AddPairsToSecondaryQueue([(C, 'g')])
+    c._UpdateForHelperProcess()
+    h.UseHelper(False)
+    h.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData])
+    h.fScanners.Script(SECONDARY_SCOPE, (B, 'f'), [kReadyToScan])
+    c.AddPairsToPrimaryQueue([(A, '*'), (C, 'f')])
+    c._CB_DoIdleAnalysis()
+    assert c._CScanCoordinator__DoSecondarySingleScopeScan(B, 'f', end_in()) is True
     c._fIncompleteScansByLoc[A] = {'f'}
     record_signals(c, h.fLog, 'scheduled', 'end')
-    refs = [weakref.ref(c), weakref.ref(h.fAnaMgr)]
+    refs = [weakref.ref(o) for o in (c, h.fAnaMgr, *h.fScanners.Made())]
+    assert len(refs) == 4
     c.destroy()
+    assert h.fScanners.Made()[0].Connections() == 0
     h.Destroy()
+    h.fScanners.fCreated.clear()
+    Callbacks.fConnects.clear()
     singleton.ResetSingletons()
+    ostrelgtk.reset()
     del c, h
     gc.collect()
-    assert [r() for r in refs] == [None, None]
+    assert [r() for r in refs] == [None] * 4

@@ -94,8 +94,6 @@ def test_unready_remote_files_are_always_passed_on(coord, host, monkeypatch):
         add_imports(coord, [b':ios'])
 
 
-# ---- modification times ------------------------------------------------------------------------
-
 def test_the_modtime_dict_from_buffers_and_disk(coord, host):
     host.fCacheMgr.OpenBuffer(L2, modified=True, mtime=7.0)
     host.fCacheMgr.OpenBuffer(L3, modified=False, mtime=42.5)
@@ -140,9 +138,3 @@ def test_get_modtimes_waits_for_inspection(coord, host, monkeypatch, force, caps
     assert capsys.readouterr().out == (
         f'Skipping modtime processing due to remote agent abort: {locs}\n')
     assert len(got) == 1 and host.fLog == []
-
-
-def test_get_modtimes_with_the_real_inspection(coord, host):
-    got = []
-    coord._CScanCoordinator__GetModtimes([L1, L2], got.append)
-    assert got == [{L1: 100.0, L2: 100.0}]

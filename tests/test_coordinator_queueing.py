@@ -5,9 +5,7 @@ and failing collaborators leave behind."""
 import pytest
 import singleton
 from coord_doubles import *
-from doubles import LocalLocation
 from guiutils import ostrelgtk
-from ostrelbase import location
 from queue_helpers import check_invariants
 
 A, B, C, D, E, F = (local(f'{n}.py') for n in 'abcdef')
@@ -32,12 +30,7 @@ def test_priority_rule(coord, kwargs, expected):
                              (C, 'g', DERIVED): expected}
     # Only primary pairs register their files for the whole-file check.
     assert whole_files(coord) == [(A, expected), (B, expected)]
-    coord.AddPairsToPrimaryQueue([(D, 'f')], False, 0)
-    coord.AddPairsToSecondaryQueue([(D, 'g')], True, 3)
-    assert queued(coord)[(D, 'f', PRIMARY)] == 0 and queued(coord)[(D, 'g', DERIVED)] == 3
 
-
-# ---- the primary queue and the helper process -------------------------------------------
 
 def test_without_helper_primary_pairs_are_queued_locally(coord, host):
     host.fDataCache.fReady.add(R)
@@ -71,20 +64,6 @@ def test_the_helper_takes_local_unopened_whole_files(coord, host):
     assert coord._fIdleProcId is None and whole_files(coord) == [(C, 2), (B, 2), (R, 2)]
 
 
-def test_can_send_to_helper_process(coord, host):
-    class ProjectLocation(location.CLocalFileLocation):
-        __slots__ = ()
-
-    host.fCacheMgr.OpenBuffer(B)
-    mine = ProjectLocation('/src/mine.py')
-    answers = [coord._CanSendToHelperProcess(loc, scope) for loc, scope in [
-        (A, '*'), (B, '*'), (mine, '*'), (A, 'Cls.m'), (A, ''), (R, '*'),
-        (LocalLocation('a.py'), '*'), (object(), 'Cls')]]
-    assert answers == [True, False, True, False, False, False, False, False]
-    assert host.fLog.args('cache_mgr', 'DoesCacheBufferExist') == [(A, True), (B, True),
-                                                                   (mine, True)]
-
-
 def test_secondary_pairs_are_filtered_by_want_derived_info(coord, host):
     host.UseHelper()  # never used for secondary scans
     host.fLocCache.fAnswers = {B: 0, C: 'yes', D: ''}
@@ -96,8 +75,6 @@ def test_secondary_pairs_are_filtered_by_want_derived_info(coord, host):
     coord.AddPairsToSecondaryQueue([(B, 'x')])
     assert coord._fIdleProcId is None
 
-
-# ---- needs-scan sets and reports -----------------------------------------------------------
 
 def test_needs_scan_set_queues_secondary_then_primary(coord, host):
     host.fCacheMgr.OpenBuffer(B)
@@ -131,8 +108,6 @@ def test_needs_scan_report_groups_by_scan_name_in_first_seen_order(coord, host, 
     coord._CB_NeedsScanAdded(host.fInfoCache, [(D, 'f', DERIVED)], None)
     assert coord._fIdleProcId is not None  # scheduled even when nothing was queued
 
-
-# ---- the caret leaving incomplete scopes --------------------------------------------------
 
 def test_the_caret_leaving_incomplete_scopes_requeues_them(coord, host):
     coord._fIncompleteScansByLoc[A] = ['g', 'f', 'h']
@@ -172,8 +147,6 @@ def test_locations_added_by_the_queue_schedule_the_idle(coord, host):
     assert coord._fIdleProcId is None
 
 
-# ---- the builtins and typing modules ---------------------------------------------------------
-
 def test_basic_modules_are_queued_once_per_flush(coord, host):
     host.fFactory.SetBuiltins('bltns', [BT])
     host.fFactory.fTypingLocs = [T1, T2]
@@ -203,8 +176,6 @@ def test_basic_modules_wait_for_the_builtins_module(coord, host):
     assert coord._fIdleProcId is None
 
 
-# ---- parseable files ---------------------------------------------------------------------------
-
 def test_parseables_with_analysable_mime_types_are_queued_whole(coord, host):
     host.fFileAttribMgr.fMimeTypes = {A: PY, B: 'text/plain', C: PY}
     coord.AddParseablesToQueue(iter([A, B, C, A, D]))
@@ -221,8 +192,6 @@ def test_parseables_with_analysable_mime_types_are_queued_whole(coord, host):
     coord.AddParseablesToQueue([E])
     assert queued(coord)[(E, '*', PRIMARY)] == 2 and len(host.fLog.find('newer')) == 1
 
-
-# ---- queries, removing, flushing ----------------------------------------------------------------
 
 def test_queries(coord, host):
     assert coord.QueuesEmpty() is True
@@ -260,15 +229,6 @@ def test_remove_locations_from_queue(coord, make):
     check_invariants(coord._fScanQueue)
 
 
-def test_clear_last_scan_info(coord):
-    for i, loc in enumerate((A, B, C)):
-        coord._fLastScanCompleted[loc] = {('*', PRIMARY): float(i)}
-    coord._fMTimeAtLastWholeFileCheck.update({A: 1.0, C: 3.0, D: 4.0})
-    assert coord.ClearLastScanInfo(loc for loc in (A, C, E)) is None
-    assert set(coord._fLastScanCompleted) == {B}
-    assert coord._fMTimeAtLastWholeFileCheck == {D: 4.0}
-
-
 def test_flush_queue_in_order(coord, host):
     host.UseHelper()
     coord.AddPairsToPrimaryQueue([(A, '*'), (B, 'f'), (W, '*')])
@@ -277,33 +237,28 @@ def test_flush_queue_in_order(coord, host):
     coord._QueueBasicModules(0.0)
     coord._fLastScanCompleted[B] = {('f', PRIMARY): 1.0}
     coord._fMTimeAtLastWholeFileCheck[B] = 1.0
-    sid = coord._fIdleProcId
 
-    def state():
-        return (coord._fIdleProcId, coord._fScanQueue.Empty(), len(coord._fLastScanCompleted),
-                len(coord._fMTimeAtLastWholeFileCheck), coord._fAllBasicModuleQueued,
-                coord.fWaitingForRemote, set(coord._fLocsQueuedInHelper))
+    def state(*args, **kwargs):
+        host.fLog.add('state', (
+            coord._fIdleProcId, coord._fScanQueue.Empty(), len(coord._fLastScanCompleted),
+            len(coord._fMTimeAtLastWholeFileCheck), coord._fAllBasicModuleQueued,
+            coord.fWaitingForRemote, set(coord._fLocsQueuedInHelper)))
 
-    record_signals(coord, host.fLog, 'end', probe=state)
-    host.fCacheMgr.Probe('_ClearEOLBlindCacheAndScans', lambda: host.fLog.add('probe', state()))
-    host.fHelper.Probe('FlushQueue', lambda **k: host.fLog.add('probe', state()))
+    coord.connect('end', state)
+    host.fCacheMgr.Probe('_ClearEOLBlindCacheAndScans', state)
+    host.fHelper.Probe('FlushQueue', state)
     host.fLog.clear()
     assert coord.FlushQueue() is None
-    assert [(c.who, c.what) for c in host.fLog if c.who != 'probe'] == [
-        ('signal', 'end'), ('cache_mgr', '_ClearEOLBlindCacheAndScans'), ('helper', 'FlushQueue')]
-    assert host.fLog.find('helper')[0].kwargs == {'callback': None}
     cleared = (None, True, 0, 0, False, False, {A})
-    assert [c.kwargs['state'] if c.who == 'signal' else c.what for c in host.fLog
-            if c.who in ('signal', 'probe')] == [(None, False, 1, 1, True, True, {A}), cleared,
-                                                 (*cleared[:-1], set())]
-    assert not ostrelgtk.GetMainLoop().has_source(sid) and coord.QueuesEmpty()
+    assert [c.what for c in host.fLog] == [
+        (None, False, 1, 1, True, True, {A}), '_ClearEOLBlindCacheAndScans', cleared,
+        'FlushQueue', (*cleared[:-1], set())]
+    assert host.fLog[-2].kwargs == {'callback': None} and coord.QueuesEmpty()
     host.UseHelper(False)
     host.fLog.clear()
     coord.FlushQueue()  # no idle: no "end"; no helper: nothing to flush
-    assert [c.who for c in host.fLog] == ['cache_mgr', 'probe']
+    assert [c.who for c in host.fLog] == ['cache_mgr', 'state']
 
-
-# ---- bad input and failing collaborators -----------------------------------------------------
 
 @pytest.mark.parametrize('helper', [False, True])
 @pytest.mark.parametrize('bad, exc', [((B, 'f', 'x'), ValueError), (None, TypeError)])

@@ -2,20 +2,17 @@
 arguments, one scanner over several slices, waiting for data, the follow-up work
 of finished and abandoned scans (imports, secondary locations, secondary scans,
 instance scopes), the incomplete-scope sets, and scanners that raise."""
-import gc
-import weakref
 from types import SimpleNamespace
 
 import pytest
-import singleton
 from coord_doubles import *
-from guiutils import ostrelgtk
 
 from pysource import logicalline, scopescanner
 
 A, B, PKG = local('pkg/a.py'), local('pkg/b.py'), local('pkg')
 kKinds = [PRIMARY_WHOLE, PRIMARY_SCOPE, SECONDARY_WHOLE, SECONDARY_SCOPE]
-kItems = {PRIMARY_WHOLE: CScanItem(A, '*', PRIMARY, 1), PRIMARY_SCOPE: CScanItem(A, 'C.m', PRIMARY, 1),
+kItems = {PRIMARY_WHOLE: CScanItem(A, '*', PRIMARY, 1),
+          PRIMARY_SCOPE: CScanItem(A, 'C.m', PRIMARY, 1),
           SECONDARY_WHOLE: CScanItem(A, '*', DERIVED, 1),
           SECONDARY_SCOPE: CScanItem(A, 'C.m', DERIVED, 1)}
 kKeys = {PRIMARY_WHOLE: A, PRIMARY_SCOPE: (A, 'C.m'), SECONDARY_WHOLE: A,
@@ -25,10 +22,8 @@ kKeys = {PRIMARY_WHOLE: A, PRIMARY_SCOPE: (A, 'C.m'), SECONDARY_WHOLE: A,
 def run_scan(coord, kind, end_time=None, item=None):
     item = item or kItems[kind]
     end_time = end_in() if end_time is None else end_time
-    method = getattr(coord, {PRIMARY_WHOLE: '_CScanCoordinator__DoPrimaryWholeFileScan',
-                             PRIMARY_SCOPE: '_CScanCoordinator__DoPrimarySingleScopeScan',
-                             SECONDARY_WHOLE: '_CScanCoordinator__DoSecondaryWholeFileScan',
-                             SECONDARY_SCOPE: '_CScanCoordinator__DoSecondarySingleScopeScan'}[kind])
+    names = ['PrimaryWholeFile', 'PrimarySingleScope', 'SecondaryWholeFile', 'SecondarySingleScope']
+    method = getattr(coord, f'_CScanCoordinator__Do{names[kKinds.index(kind)]}Scan')
     if kind == SECONDARY_SCOPE:
         return method(item.loc, item.scope_name, end_time)
     return method(item, end_time)
@@ -65,29 +60,20 @@ def test_one_scanner_runs_a_scan_over_several_slices(coord, host, kind):
     assert host.fScanners.Made()[-1].fDestroyCount == 1 and active(coord, kind) == {}
 
 
-def test_scanner_arguments_and_log_messages(coord, host):
-    for kind in kKinds:
-        host.fScanners.Script(kind, kKeys[kind], [kReadyToScan, kFinishedScanning])
-        assert run_scan(coord, kind) is True
-    pw, ps, sw, ss = host.fScanners.Made()
-    assert (pw.fArgs, ps.fArgs, sw.fArgs) == ((A, PRIMARY), (A, 'C.m'), (A, DERIVED, coord.fLog))
-    for scanner in (pw, ps):
-        assert scanner.fKwargs == {'incomplete_scope_set': coord._fIncompleteScansByLoc[A],
-                                   'log': coord.fLog}
-        assert scanner.fKwargs['incomplete_scope_set'] is coord._fIncompleteScansByLoc[A]
-    assert ss.fArgs == (host.fInfoCache.fScopeInfos[(A, 'C.m')], coord.fLog, None, host.fAnaMgr)
+def test_log_messages_pass_their_values_separately(coord, host):
     for kind in kKinds:
         run_scan(coord, kind)
     assert coord.fLog.fCalls == [
         ('Starting primary whole file scan: %r', (A,)),
-        ('starting primary scope scan: scope=%r, file=%r', ('C.m', A)),
-        ('Starting secondary whole file scan: %r', (A,)),
         ('Finished primary whole file scan: %r', (A,)),
+        ('starting primary scope scan: scope=%r, file=%r', ('C.m', A)),
         ('finished primary scope scan: scope=%r, file=%r, changed=%s', ('C.m', A, True)),
+        ('Starting secondary whole file scan: %r', (A,)),
         ('Finished secondary whole file scan: %r', (A,))]
+    ps = host.fScanners.Made(PRIMARY_SCOPE)[0]
+    assert ps.fArgs == (A, 'C.m') and ps.fKwargs == {
+        'incomplete_scope_set': coord._fIncompleteScansByLoc[A], 'log': coord.fLog}
 
-
-# ---- waiting for data -----------------------------------------------------------------------
 
 @pytest.mark.parametrize('kind', [PRIMARY_WHOLE, PRIMARY_SCOPE])
 def test_a_primary_item_waits_for_its_scanners_data(coord, host, kind):
@@ -126,8 +112,6 @@ def test_a_secondary_item_waiting_for_data_stays_queued(coord, host, kind):
     assert coord._CB_DoIdleAnalysis() is False
     assert host.fScanners.One().Connections() == 0
 
-
-# ---- whole-file primary scans ----------------------------------------------------------------
 
 def test_a_finished_whole_file_scan_queues_its_follow_up_work(coord, host):
     sec1, sec2, mod = local('pkg/a_impl.py'), local('other/a_data.py'), local('lib/os.py')
@@ -175,8 +159,6 @@ def test_secondary_locations_come_from_the_application_analysis_manager(coord, h
     assert queued(coord) == {(sec, '*', PRIMARY): 1, (A, '*', DERIVED): 1}
     other.Destroy()
 
-
-# ---- single-scope primary scans -----------------------------------------------------------------
 
 def test_a_single_scope_scan_refreshes_an_existing_analysis(coord, host):
     host.fCacheMgr.fAnalyses[A] = Analysis(A, host.fLog)
@@ -243,8 +225,6 @@ def test_an_instance_scope_is_built_without_a_scanner(coord, host):
     assert queued(coord) == {(A, '', PRIMARY): 1}  # the parent scope, to learn about C
 
 
-# ---- secondary scans -------------------------------------------------------------------------------
-
 @pytest.mark.parametrize('kind', [SECONDARY_WHOLE, SECONDARY_SCOPE])
 def test_secondary_scans_not_wanted_leave_their_scanner_alone(coord, host, kind):
     host.fScanners.Script(kind, kKeys[kind], [kReadyToScan, kFinishedScanning])
@@ -278,27 +258,3 @@ def test_a_single_scope_secondary_scan_looks_up_its_information_every_time(coord
     assert host.fScanners.Made() == [scanner] and active(coord, SECONDARY_SCOPE) == {}
     assert len(host.fLog.find('info_cache', 'GetScopeInfo')) == 4
     assert coord.fLog.fCalls == []  # single-scope secondary scans log nothing
-
-
-# ---- reference cycles ------------------------------------------------------------------------------
-
-def test_a_coordinator_with_waiting_and_unfinished_scanners_is_freed(monkeypatch):
-    h = Host().Patch(monkeypatch)
-    c = make_coord(h)
-    h.fAnaMgr.fScanCoordinator = c
-    # coordinator -> active scanners -> their "scan-state-changed" handler -> coordinator
-    h.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData])
-    h.fScanners.Script(SECONDARY_SCOPE, (B, 'f'), [kReadyToScan])
-    queue_item(c, CScanItem(A, '*', PRIMARY, 1))
-    c._CB_DoIdleAnalysis()
-    assert c._CScanCoordinator__DoSecondarySingleScopeScan(B, 'f', end_in()) is True
-    refs = [weakref.ref(o) for o in (c, *h.fScanners.Made())]
-    c.destroy()
-    assert h.fScanners.Made()[0].Connections() == 0
-    h.Destroy()
-    h.fScanners.fCreated.clear()
-    singleton.ResetSingletons()
-    ostrelgtk.reset()
-    del c, h
-    gc.collect()
-    assert [r() for r in refs] == [None] * 3

@@ -94,11 +94,6 @@ def test_one_database_write_at_a_time(coord, host):
     with pytest.raises(Boom):
         coord._CB_WriteToDatabase()
     assert coord._fIdleToWriteToDatabase is None  # a failed write can be asked for again
-    # The write goes to the analysis manager's current information cache.
-    other = []
-    host.fAnaMgr.fInfoCache = type('Cache', (), {'WriteToDatabase': lambda self: other.append(1)})()
-    coord._CB_WriteToDatabase()
-    assert other == [1] and len(host.fLog.find('info_cache', 'WriteToDatabase')) == 2
     coord._ScheduleWriteToDatabaseIdle()
     coord.destroy()
     assert pending_callbacks(coord, '_CB_WriteToDatabase') == []

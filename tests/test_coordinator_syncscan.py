@@ -46,8 +46,6 @@ def move_clock(monkeypatch, now, state=kFinishedScanning):
     return step
 
 
-# ---- TryToScanDictNow ---------------------------------------------------------------------
-
 def test_derived_triples_are_queued_unless_active_or_pending(coord, sync):
     assert coord.TryToScanDictNow(A, 'f', frozenset(), end_in()) is False
     assert sync.fLog == []
@@ -141,8 +139,6 @@ def test_reentry_serves_a_promised_triple_once(coord, sync):
     assert sets(coord) == (set(), set()) and queued(coord) == {D1: 1, T2: 1}
 
 
-# ---- TryToScanNow --------------------------------------------------------------------------
-
 @pytest.mark.parametrize('script, answer, left', [
     ({'file_doesnt_exist': True}, (False, None, None), {D1: 2}),
     ({'states': [kWaitingForData]}, (True, None, None), {T1: 1, D1: 2}),
@@ -169,13 +165,11 @@ def test_a_completed_scan_is_saved_and_followed_by_the_secondary_scan(coord, syn
     end = end_in()
     assert coord.TryToScanNow(B, 'h', None, end) is None
     primary, secondary = sync.fScanners.Made()
-    assert primary.fArgs == (B, 'h') and primary.fSaves == [()]
     assert primary.fKwargs['incomplete_scope_set'] is coord._fIncompleteScansByLoc[B]
     assert secondary.fArgs == (info, coord.fLog, None, sync.fAnaMgr)
-    assert primary.fScans == secondary.fScans == [end]
+    assert primary.fScans == secondary.fScans == [end] and queued(coord) == {}
     assert [c.what for c in sync.fLog.find('scanner')] == [
         'create', 'Scan', 'SaveToInfoCache', 'destroy', 'create', 'Scan', 'destroy']
-    assert queued(coord) == {}
 
 
 @pytest.mark.parametrize('names, kinds', [
@@ -227,8 +221,6 @@ def test_an_unfinished_scan_stays_queued_and_the_idle_loop_completes_it(coord, s
     assert ostrelgtk.run_until_idle(100)
     assert len(sync.fScanners.Made(PRIMARY_SCOPE)) == 2 and coord.QueuesEmpty()
 
-
-# ---- instance scopes by inference ---------------------------------------------------------------
 
 kClassEquivs = {
     'm': method_def('C.m'), 'x': b':lint', 'k': b':lint;' + method_def('C.k', bound=True),
@@ -304,16 +296,8 @@ def test_running_out_of_time_among_the_methods_keeps_the_result_unstored(coord, 
     assert (A, 'C.late') not in engine_lookups(sync) and sync.fInfoCache.fAdded == []
 
 
-@pytest.mark.parametrize('kind', ['str', 'bytearray'])
-def test_a_definition_that_is_not_bytes_is_a_type_error(coord, sync, monkeypatch, kind):
-    packed = method_def('C.m')
-    if kind == 'str':  # the equivalents are bytes, but the split hands back text
-        equivs = {'m': packed}
-        real_split = symbolinfo.NonNestedSplit
-        monkeypatch.setattr(symbolinfo, 'NonNestedSplit',
-                            lambda text, sep: [p.decode() for p in real_split(text, sep)])
-    else:
-        equivs = {'m': bytearray(packed)}
+def test_a_definition_that_is_not_bytes_is_a_type_error(coord, sync):
+    equivs = {'m': bytearray(method_def('C.m'))}
     sync.fEngine.fInfos[(A, 'C')] = scope_info(A, 'C', equivs)
     sync.fEngine.fInfos[(A, 'C.m')] = scope_info(A, 'C.m')
     with pytest.raises(TypeError):
@@ -331,8 +315,6 @@ def test_instance_builders_want_an_instance_scope(coord, sync, method):
         getattr(coord, method)(A, 'C', end_in())
 
 
-# ---- instance scopes from the information cache -------------------------------------------------
-
 @pytest.mark.parametrize('scope', ['C()', 'outer.C()'])
 def test_a_class_its_parent_does_not_define(coord, sync, inst_spy, scope):
     parent = symbolinfo.ParentScopeName(scope)
@@ -346,7 +328,8 @@ def test_a_class_its_parent_does_not_define(coord, sync, inst_spy, scope):
     assert [info.key for info in added] == [
         scopeinfo.CScopeInfoKey(A, scope[:-2], PRIMARY, A, scope[:-2]),
         scopeinfo.CScopeInfoKey(A, scope, PRIMARY, A, scope)]
-    assert all((i.def_info, i.disk_mtime, i.incomplete, i.does_not_exist) == (b'', 42.5, False, True)
+    assert all((i.def_info, i.disk_mtime, i.incomplete, i.does_not_exist) ==
+               (b'', 42.5, False, True)
                for i in added)
     assert result is added[1] and queued(coord) == {}
 

@@ -21,25 +21,16 @@ MODULE_NAMES = ['bisect', 'collections', 'itertools', 'sys', 'time',
                 'strutils']
 
 
-def test_collaborator_modules_are_bound_under_their_names():
-    import config
+def test_collaborator_modules_are_bound_in_body_order():
     import singleton
-    from guiutils import ostrelgtk
 
-    from pysource import _fastaccess, symbolinfo
-    for name in MODULE_NAMES:
-        assert isinstance(getattr(sc, name), types.ModuleType), name
-    assert sc.ostrelgtk is ostrelgtk
-    assert sc.config is config and sc.singleton is singleton
-    assert sc.symbolinfo is symbolinfo and sc._fastaccess is _fastaccess
-
-
-def test_names_are_bound_in_body_order():
+    from pysource import _fastaccess
+    assert all(isinstance(getattr(sc, name), types.ModuleType) for name in MODULE_NAMES)
+    assert sc.singleton is singleton and sc._fastaccess is _fastaccess
     names = list(vars(sc))
     order = [*MODULE_NAMES, 'CScanItem', 'kTypingModulePriority', '_CSingleScanQueue',
              '_CScanQueue', 'CSingleQueueStatus', 'CScanStatus', 'CScanCoordinator']
-    positions = [names.index(n) for n in order]
-    assert positions == sorted(positions)
+    assert [names.index(n) for n in order] == sorted(names.index(n) for n in order)
 
 
 def test_constants_records_and_classes():
@@ -72,10 +63,11 @@ class TestInitialisation:
     def test_importing_again_returns_the_same_module(self):
         mod = sys.modules.pop('pysource.scancoordinator')
         try:
-            again = importlib.import_module('pysource.scancoordinator')
-            assert again is mod
+            assert importlib.import_module('pysource.scancoordinator') is mod
         finally:
             sys.modules['pysource.scancoordinator'] = mod
+        spec = importlib.util.find_spec('pysource.scancoordinator')
+        assert spec.loader.create_module(spec) is sc
 
     def test_executing_the_body_for_another_module_object_raises(self):
         lib = ctypes.PyDLL(sc.__file__)
@@ -111,8 +103,3 @@ class TestInitialisation:
         assert out.returncode == 0, out.stderr
         assert ('ImportError: Interpreter change detected - this module can only be loaded '
                 'into one interpreter per process.') in out.stdout
-
-    def test_spec_loader_round_trip_returns_the_loaded_module(self):
-        spec = importlib.util.find_spec('pysource.scancoordinator')
-        created = spec.loader.create_module(spec)
-        assert created is sc

@@ -33,8 +33,6 @@ def listing(q, **kwargs):
     return out
 
 
-# ---- arguments ---------------------------------------------------------------------
-
 def test_single_queue_construction():
     sq = sc._CSingleScanQueue(order=-3, priority=True, scan_name='scan')
     assert (sq.fScanName, sq.fPriority, sq.fOrder, len(sq.fOrderedDict)) == ('scan', 1, -3, 0)
@@ -52,15 +50,6 @@ def test_single_queue_construction():
         sc._CSingleScanQueue('scan', 2, 0, x=1)
     with pytest.raises(TypeError, match=r"got multiple values for keyword argument 'order'$"):
         sc._CSingleScanQueue('scan', 2, 0, order=1)
-
-
-def test_fields_are_read_only(queue):
-    sq = sc._CSingleScanQueue('scan', 1, 0)
-    for obj, name in [(sq, 'fScanName'), (sq, 'fPriority'), (sq, 'fOrderedDict'),
-                      (queue, '_fPerLocationInfo'), (queue, 'fAnyAsyncInspectLocation'),
-                      (queue, '_fScansToOrder')]:
-        with pytest.raises(AttributeError):
-            setattr(obj, name, getattr(obj, name))
 
 
 @pytest.mark.parametrize('bad, exc, message', [
@@ -129,8 +118,6 @@ def test_a_failing_readiness_check_propagates(queue, data_cache):
     assert snapshot(queue) == before
 
 
-# ---- scan orders ---------------------------------------------------------------------
-
 def test_name_without_order_sorts_as_order_zero(data_cache, capsys):
     q = make_queue(load_impl('compiled'), data_cache, orders={S: -1, T: 1})
     for name in (T, 'other', S):
@@ -156,8 +143,6 @@ def test_scan_names_of_one_order_share_a_single_queue(data_cache):
     assert q.First() == (A, 'a', S, 2)
     q.destroy()
 
-
-# ---- queries not modelled elsewhere ------------------------------------------------------
 
 def test_priority_of_a_parked_location(queue, data_cache):
     park(queue, data_cache, X, 'f', priority=3)
@@ -194,8 +179,6 @@ def test_readiness_is_asked_only_once_a_remote_file_was_seen(queue, data_cache, 
     assert queue.IsTreeBranchReady(X) is False
 
 
-# ---- the listing ----------------------------------------------------------------------
-
 def test_listing(queue, data_cache, capsys):
     queue.AddScanPairs([(A, 'b'), (A, 'a'), (B, '*')], S, 2)
     queue.AddScanPairs([(C, 'x')], T, 1)
@@ -221,8 +204,6 @@ def test_listing(queue, data_cache, capsys):
         f'  File: {X!r}\n', '  ...\n', 'Waiting for remote on 1 scans\n',
         f'  Scan: {item!r}\n', '  ...\n']
 
-
-# ---- signals and the GUI manager ------------------------------------------------------------
 
 def test_handler_changes_go_to_a_new_emission(queue, signals):
     seen = []
@@ -262,8 +243,6 @@ def test_the_gui_managers_documents_are_promoted(queue):
     assert gui.fCalls == [('GetActiveDocument',)]  # not a source editor: ignored
     gui.destroy()
 
-
-# ---- clearing, destruction, cycles ---------------------------------------------------------
 
 def test_clear_destroys_the_old_single_queues(queue, data_cache):
     queue.AddScanPairs([(A, 'f')], S)
@@ -308,8 +287,6 @@ def test_destroyed_queue_is_collected_despite_cycles(data_cache):
     assert [r() for r in refs] == [None, None]
     gui.destroy()
 
-
-# ---- agreement with the reference where set order decides --------------------------------
 
 def test_parked_items_iterate_as_in_the_reference(data_cache):
     """Parked work is re-queued in the iteration order of its item set, and that order

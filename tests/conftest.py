@@ -1,9 +1,6 @@
-"""Shared test set-up: the stand-in host, the built extensions and the reference
-queue importable; a fresh main loop and fresh singletons around every test.
-
-`./run test` already puts the host and the extensions on PYTHONPATH; this keeps
-a bare `pytest` run in a prepared checkout working too (`./run build` first).
-"""
+"""Shared set-up: the stand-in host, the built extensions (also for a bare
+`pytest` after `./run build`) and the reference queue importable; a fresh main
+loop and fresh singletons around every test."""
 import os
 import sys
 from pathlib import Path

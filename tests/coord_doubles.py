@@ -10,6 +10,7 @@ repeats), the logger with a `RecordingLogger`, and the exception reporter.
 """
 import collections
 import io
+import re
 import sys
 import time
 from types import SimpleNamespace
@@ -90,20 +91,6 @@ class Scripted:
 
 PRIMARY_WHOLE, PRIMARY_SCOPE = 'CWholeFilePrimaryScanner', 'CSingleScopePrimaryScanner'
 SECONDARY_WHOLE, SECONDARY_SCOPE = 'CWholeFileSecondaryScanner', 'CSingleScopeSecondaryScanner'
-kActiveFields = {
-    PRIMARY_WHOLE: '_CScanCoordinator__fActivePrimaryWholeFileScanners',
-    PRIMARY_SCOPE: '_CScanCoordinator__fActivePrimarySingleScopeScanners',
-    SECONDARY_WHOLE: '_CScanCoordinator__fActiveSecondaryWholeFileScanners',
-    SECONDARY_SCOPE: '_CScanCoordinator__fActiveSecondarySingleScopeScanners',
-}
-
-
-class Script(SimpleNamespace):
-    def __init__(self, states=(kFinishedScanning,), info=None, scope_def=None,
-                 containing_class_def=None, file_doesnt_exist=False, changed=True):
-        super().__init__(states=list(states), info=info, scope_def=scope_def,
-                         containing_class_def=containing_class_def,
-                         file_doesnt_exist=file_doesnt_exist, changed=changed)
 
 
 def add_incomplete(names, state=kFinishedScanning):
@@ -120,7 +107,7 @@ class _Scanner:
     def _Setup(self, key, args, kwargs):
         destroyable.CDestroyable.__init__(self, ('scan-state-changed',))
         self.fKey, self.fArgs, self.fKwargs = key, args, kwargs
-        script = self.fKit.fScripts.get((self.kKind, key)) or Script()
+        script = self.fKit.fScripts.get((self.kKind, key)) or self.fKit.Script(None, None)
         self.fScript, self.fStates = script, list(script.states)
         self.fInfo, self.fScopeDef = script.info, script.scope_def
         self.fContainingClassDef = script.containing_class_def
@@ -184,8 +171,12 @@ class ScannerKit:
         self.fClasses = {kind: type(kind, (base,), {'fKit': self, 'kKind': kind})
                          for kind, base in bases.items()}
 
-    def Script(self, kind, key, states=(kFinishedScanning,), **attrs):
-        self.fScripts[(kind, key)] = Script(states, **attrs)
+    def Script(self, kind, key, states=(kFinishedScanning,), info=None, scope_def=None,
+               containing_class_def=None, file_doesnt_exist=False, changed=True):
+        self.fScripts[(kind, key)] = script = SimpleNamespace(
+            states=list(states), info=info, scope_def=scope_def, changed=changed,
+            containing_class_def=containing_class_def, file_doesnt_exist=file_doesnt_exist)
+        return script
 
     def Made(self, kind=None):
         return [s for s in self.fCreated if kind in (None, s.kKind)]
@@ -536,7 +527,10 @@ def data_waiting(coord):
 
 
 def active(coord, kind):
-    return dict(getattr(coord, kActiveFields[kind]))
+    """The coordinator's unfinished scanners of that kind (PRIMARY_WHOLE, ...)."""
+    pattern = r'C(WholeFile|SingleScope)(Primary|Secondary)Scanner'
+    extent, role = re.fullmatch(pattern, kind).groups()
+    return dict(getattr(coord, f'_CScanCoordinator__fActive{role}{extent}Scanners'))
 
 
 def pending_callbacks(coord, name='_CB_DoIdleAnalysis'):

@@ -1,9 +1,5 @@
-"""Fixtures and checks shared by the scan-queue tests.
-
-A test that takes `impl` runs against the compiled module and against the
-pure-Python reference queue (bench/reference_queue.py); everything else runs
-against the compiled module only.
-"""
+"""Fixtures and checks shared by the scan-queue tests; a test that takes `impl`
+runs against the compiled queue and against bench/reference_queue.py."""
 import collections
 import types
 

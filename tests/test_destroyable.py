@@ -51,11 +51,8 @@ def names(calls):
 
 
 def test_fields_and_declarations(make):
-    class Name(str):
-        pass
-
     calls, prefix = [], "chan"
-    named = CDestroyable(s for s in [Name(prefix + "ged")])
+    named = CDestroyable(s for s in [type("Name", (str,), {})(prefix + "ged")])
     named.connect("changed", lambda: calls.append(1))  # names match by value
     named.emit(f"{prefix}ged")
     assert calls == [1]

@@ -13,12 +13,10 @@ import pytest
 
 import pysource.scancoordinator as sc
 
-MODULE_NAMES = ['bisect', 'collections', 'itertools', 'sys', 'time',
-                'textcache', 'ostrelgtk', 'logicalline', 'destroyable', 'location', 'mime',
-                'callutils', 'reflect', 'config', 'singleton',
-                'analysis', 'inferenceengine', 'inferencer', 'prefs', 'scopescanner',
-                'scopeinfo', 'symbolinfo', 'usageordereddict', 'utils', '_fastaccess',
-                'strutils']
+MODULE_NAMES = ['bisect', 'collections', 'itertools', 'sys', 'time', 'textcache', 'ostrelgtk',
+                'logicalline', 'destroyable', 'location', 'mime', 'callutils', 'reflect', 'config',
+                'singleton', 'analysis', 'inferenceengine', 'inferencer', 'prefs', 'scopescanner',
+                'scopeinfo', 'symbolinfo', 'usageordereddict', 'utils', '_fastaccess', 'strutils']
 
 
 def test_collaborator_modules_are_bound_in_body_order():

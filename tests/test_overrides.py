@@ -1,8 +1,6 @@
-"""Override dispatch: every overridable operation that the module calls itself
-reaches a Python subclass's override, and what the override returns is used.
-
-Each row names an operation and an action that makes the module call it
-internally; the subclass records the call and delegates to the base class."""
+"""Override dispatch: each row names an overridable operation and an action that
+makes the module call it internally; a Python subclass's override (which
+records the call and delegates) must be called, and what it returns used."""
 import time
 
 import pytest
@@ -38,27 +36,14 @@ def single_scan(scope, name=PRIMARY):
     return lambda c, h: c._DoSingleScan(CScanItem(A, scope, name, 1), end_in())
 
 
-def wait_for_data(c, h):
-    h.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData])
-    single_scan('*')(c, h)
-
-
-def out_of_time(c, h):
-    c.TryToScanDictNow(A, 'f', [(A, 'f', PRIMARY), (A, 'g', PRIMARY)], time.time() - 1)
-
-
-def with_helper(c, h):
-    h.UseHelper()
-    c.AddPairsToPrimaryQueue([(A, '*')])
-
-
 kCoordinatorRows = {
     '_ScheduleIdle': lambda c, h: c.AddPairsToPrimaryQueue([(A, 'f')]),
     '_CancelIdle': lambda c, h: c.SuspendIdleScans(),
     'QueuesEmpty': lambda c, h: (c.SuspendIdleScans(), c.ResumeIdleScans()),
     'AddPairsToPrimaryQueue': lambda c, h: c.AddNeedsScanSetToQueues([(A, 'f', PRIMARY)]),
     'AddPairsToSecondaryQueue': lambda c, h: c.AddNeedsScanSetToQueues([(A, 'f', DERIVED)]),
-    '_CanSendToHelperProcess': with_helper,
+    '_CanSendToHelperProcess': lambda c, h: (h.UseHelper(),
+                                             c.AddPairsToPrimaryQueue([(A, '*')])),
     'ClearLastScanInfo': lambda c, h: Analysis(A, h.fLog).NotifyModified(),
     'GetStatus': lambda c, h: c._CB_UpdateStatus(),
     f'{P}EnsureStatusTimeout': idle,
@@ -74,11 +59,13 @@ kCoordinatorRows = {
     f'{P}DoSecondaryWholeFileScan': single_scan('*', DERIVED),
     f'{P}DoSecondarySingleScopeScan': single_scan('f', DERIVED),
     f'{P}AddImportEquivsToQueue': single_scan('*'),
-    '_WaitForScannerToBeReady': wait_for_data,
+    '_WaitForScannerToBeReady': lambda c, h: (
+        h.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData]), single_scan('*')(c, h)),
     'BuildInstanceScopeNoScanning': single_scan('C()'),
     'TryToScanNow': lambda c, h: c.TryToScanDictNow(A, 'f', [(A, 'f', PRIMARY)], end_in()),
     '_TryToScanInstanceScopeNow': lambda c, h: c.TryToScanNow(A, 'C()', None, end_in()),
-    'AddNeedsScanSetToQueues': out_of_time,
+    'AddNeedsScanSetToQueues': lambda c, h: c.TryToScanDictNow(  # out of time
+        A, 'f', [(A, 'f', PRIMARY), (A, 'g', PRIMARY)], time.time() - 1),
 }
 
 

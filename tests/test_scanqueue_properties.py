@@ -1,16 +1,7 @@
-"""Property-based tests of the scan queue.
-
-`QueueMachine` drives random sequences of queue operations, host signals and
-main-loop runs on the compiled queue and the pure-Python reference queue side
-by side.  Both must give equal results, fields and signals; after every step
-the structural invariants hold (read from the fields), and each operation's
-result has the properties it promises: the first scan is the most urgent one,
-removed scans are gone, promoted documents have no background work, and the
-signals announce exactly the locations that gained or lost work.
-
-The default run is kept short; set SCANQUEUE_PROPERTY_EXAMPLES (for example
-to 2000) for a longer search.
-"""
+"""Property-based tests of the scan queue: random operations, host signals and
+main-loop runs on the compiled queue and the reference queue side by side; both
+must agree, the invariants must hold after every step, and each operation must
+keep its promise.  SCANQUEUE_PROPERTY_EXAMPLES (e.g. 2000) searches longer."""
 import os
 
 import pytest

@@ -1,8 +1,5 @@
-"""CUsageOrderedDict: its order semantics against a model, robustness
-against reentrant keys and values, the cyclic GC and subclassing (its capsule C
-API is what every scan-queue test goes through).  Behaviour that a subclass
-could disturb runs against the class itself, a bare subclass and a subclass
-that counts the calls made on it."""
+"""CUsageOrderedDict: order semantics against a model, reentrant keys and values,
+the cyclic GC, subclassing (flavours: the class, a bare and a counting subclass)."""
 import collections
 import gc
 import random

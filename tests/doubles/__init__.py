@@ -1,13 +1,7 @@
 """Scripted stand-ins for the scan queue's collaborators (the benchmarks use them
-too): the location data cache and the GUI manager, which derive from the host's
-destroyable base class so that the queue connects to them as in the application,
-and location value objects naming local or remote files.
-
-Two locations are equal when they are of the same kind and have the same URL,
-and hash accordingly; the hash is a function of the URL only (no object
-identity), which keeps set and dict iteration orders identical for every queue
-that sees the same operations.
-"""
+too), and location value objects whose hash depends on the URL only, so that set
+and dict iteration orders are the same for every queue that sees the same
+operations."""
 from types import SimpleNamespace
 
 from ostrelbase import destroyable

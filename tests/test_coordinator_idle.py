@@ -11,7 +11,7 @@ import pytest
 from coord_doubles import *
 from guiutils import ostrelgtk
 
-from pysource import inferenceengine, utils
+from pysource import analysis, inferenceengine, utils
 
 A, B, C = local('a.py'), local('b.py'), local('c.py')
 
@@ -288,17 +288,17 @@ def test_recently_completed_scans_are_not_run_again(coord, host, age, skipped):
         assert coord._fLastScanCompleted[A][('f', PRIMARY)] > t + age - 1
 
 
-@pytest.mark.parametrize('name, analysis, is_python, asked', [
+@pytest.mark.parametrize('name, ana, is_python, asked', [
     ('stub.pyi', None, True, []),
     ('tool', None, True, ['IsPythonSource']),
     ('page.html', 'source', True, ['IsPythonSource', 'GetAnalysis']),
     ('notes.txt', None, False, ['IsPythonSource', 'GetAnalysis']),
     ('data.bin', 'other', False, ['IsPythonSource', 'GetAnalysis']),
 ])
-def test_the_python_check(coord, host, monkeypatch, name, analysis, is_python, asked):
+def test_the_python_check(coord, host, monkeypatch, name, ana, is_python, asked):
     loc = local(name)
     host.fCacheMgr.fAnalyses[loc] = {None: None, 'other': object(),
-                                     'source': Analysis(loc, host.fLog)}[analysis]
+                                     'source': Analysis(loc, host.fLog)}[ana]
 
     def is_python_source(arg):
         host.fLog.add('utils', 'IsPythonSource', arg)
@@ -318,6 +318,9 @@ def test_the_python_check(coord, host, monkeypatch, name, analysis, is_python, a
     removed = f'Removing scan because not python: {(loc, "f", PRIMARY)!r}'
     assert (removed in coord.fLog.Messages()) is not is_python
     assert queued(coord) == {} and (loc in coord._fLastScanCompleted) is is_python
+    monkeypatch.setattr(analysis, 'CPySourceAnalysis', 'not a class')
+    with pytest.raises(TypeError):  # the host's class check fails: the error propagates
+        coord._CScanCoordinator__GetAnalysis(loc, True)
 
 
 def test_secondary_scans_without_builtins_count_as_done(coord, host):
@@ -384,7 +387,7 @@ def test_a_failing_scanner_is_reported_reraised_and_resumed(coord, host):
 
 
 def test_the_queue_listing_and_the_run_of_slices(coord, host):
-    host.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, kReadyToScan, kFinishedScanning])
+    host.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan] * 3 + [kFinishedScanning])
     coord.AddPairsToPrimaryQueue([(A, '*')])
     t0 = time.time()
     coord._CB_DoIdleAnalysis()
@@ -393,10 +396,15 @@ def test_the_queue_listing_and_the_run_of_slices(coord, host):
     coord._CB_DoIdleAnalysis()
     assert (coord._fActiveIdleStart, coord._fLastLogQueue) == (start, start)
     assert coord.fLog.Messages() == coord.fLog.Texts()  # no listing within two seconds
+    time.sleep(2.01)
+    n = len(coord.fLog.fCalls)
+    coord._CB_DoIdleAnalysis()  # the queue is listed every two seconds of a run of slices
+    assert coord.fLog.Texts()[n:n + 2] == [kEntering, '_CScanQueue contents:\n']
+    assert coord._fLastLogQueue > start + 2 and coord._fActiveIdleStart == start
     coord._CB_DoIdleAnalysis()
     assert coord._fActiveIdleStart == -1.0
     texts = coord.fLog.Texts()
-    assert texts.index(kEmptyMsg) < texts.index('_CScanQueue contents:\n')
+    assert texts[texts.index(kEmptyMsg) + 1] == '_CScanQueue contents:\n'
     coord.fLog.fCalls.clear()
     coord.fLog.fOutputFile = None  # logging off: no listing
     coord.AddPairsToPrimaryQueue([(B, '*')])

@@ -53,6 +53,13 @@ def test_constructor_arguments(host):
             CScanCoordinator(*args, **kwargs)
     c = CScanCoordinator(ana_mgr=host.fAnaMgr, idle_priority=True)
     assert type(c.fIdlePriority) is int and c.fIdlePriority == 1
+    for name in ('_CB_WriteToDatabase', '_UpdateForHelperProcess', 'FlushQueue', 'GetStatus'):
+        with pytest.raises(TypeError, match=rf'^{name}\(\) takes exactly 0 positional'):
+            getattr(c, name)(1)
+    with pytest.raises(TypeError):
+        c.TryToScanDictNow(A, 'f', [], 'soon')
+    assert c.TryToScanDictNow(A, 'f', [], -1.0) is False  # long past: a time, not an error
+    assert host.fLog == [] and c.QueuesEmpty()
     c.destroy()
     with pytest.raises(RuntimeError, match=r'^CScanCoordinator.__init__\(\) has not been called$'):
         CScanCoordinator.__new__(CScanCoordinator).QueuesEmpty()
@@ -153,14 +160,11 @@ def seed_last_scans(coord, *locs):
         coord._fMTimeAtLastWholeFileCheck[loc] = 10.0 + i
 
 
-def test_module_cache_suspension_sets_waiting_for_remote(coord, host):
+def test_module_cache_suspension_and_modified_analyses(coord, host):
     host.fModFileCache.emit('suspend', host.fModFileCache)
     assert coord.fWaitingForRemote is True
     host.fModFileCache.emit('unsuspend')
     assert coord.fWaitingForRemote is False
-
-
-def test_a_modified_analysis_forgets_its_files_last_scans(coord, host):
     seed_last_scans(coord, A, B, C)
     Analysis(A, host.fLog).NotifyModified()
     analysis.CPySourceAnalysis(B, host.fAnaMgr).NotifyModified()

@@ -43,6 +43,9 @@ def test_imports_are_followed_only_when_asked_and_from_a_ready_directory(coord, 
     assert host.fLog.args('factory', '_FindPrimaryLocsForNames')[0][0] == {'pkg.name', 'pkg',
                                                                           'os'}
     host.fLog.clear()
+    with pytest.raises(TypeError, match='^Expected str, got int$'):
+        add_imports(coord, [b':ios', 5])
+    host.fLog.clear()
     coord._fAnalyzeFoundImports = False
     add_imports(coord, [b':ios'])
     assert host.fLog == []
@@ -66,6 +69,14 @@ def test_the_modtime_filter(coord, host):
     assert queued(coord) == {(L2, '*', PRIMARY): 2, (L3, '*', PRIMARY): 2,
                              (L5, '*', PRIMARY): 2}
     assert [a[0] for a in host.fLog.args('info_cache', 'GetDiskMTime')] == [L1, L2, L3]
+
+    class Unordered(float):
+        def __ne__(self, other):
+            raise Boom('cannot compare')
+
+    host.fInfoCache.fMTimes[L1] = Unordered(3.0)
+    with pytest.raises(Boom):
+        add_imports(coord, [b':im1'])
 
 
 @pytest.mark.parametrize('priority, passed', [(2, False), (1, False), (0, True)])

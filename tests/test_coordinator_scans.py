@@ -208,7 +208,8 @@ def test_a_changed_scope_queues_its_imports(coord, host):
     mods = {'os': local('lib/os.py'), 'json': local('lib/json/__init__.py'),
             'json.decoder': local('lib/json/decoder.py')}
     host.fFactory.fModuleLocs.update(mods)
-    info = SimpleNamespace(type_equivs={'os': b':ios;x.y', 'loads': b':fjson.decoder loads',
+    # Equivalents come as text or as UTF-8 bytes.
+    info = SimpleNamespace(type_equivs={'os': ':ios;x.y', 'loads': b':fjson.decoder loads',
                                         'data': b':lint', 'path': b'os.path;:ios'})
     host.fScanners.Script(PRIMARY_SCOPE, (A, 'f'), info=info)
     assert coord._DoSingleScan(CScanItem(A, 'f', PRIMARY, 1), end_in()) is False

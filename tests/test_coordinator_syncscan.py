@@ -1,9 +1,5 @@
-"""CScanCoordinator: scanning on the caller's stack.  `TryToScanDictNow` (which
-triples it scans, queues or leaves alone, the deadline, the two triple sets on
-every way out, re-entry from inside a scan), `TryToScanNow` (its two shared
-answers, the scans a scan-name list chooses, what stays queued), and the two
-builders of instance scopes: by inference within a deadline, and from what the
-information cache already holds."""
+"""CScanCoordinator: scanning on the caller's stack (`TryToScanDictNow`,
+`TryToScanNow`) and the two builders of instance scopes."""
 import time
 
 import pytest
@@ -82,29 +78,35 @@ def test_primary_triples_are_scanned_in_order(coord, sync):
     assert sets(coord) == ({OUTER_ACTIVE}, set())
 
 
-@pytest.mark.parametrize('way_out', ['finished', 'deadline', 'out of time', 'raises'])
+@pytest.mark.parametrize('way_out', ['finished', 'deadline', 'out of time', 'raises',
+                                     'clean-up fails', 'bad clock'])
 def test_the_triple_sets_are_restored_on_every_way_out(coord, sync, monkeypatch, way_out):
     end = 1000.5
     monkeypatch.setattr(time, 'time', lambda: 1000.0)
     coord._fActiveScanNowTriples.add(OUTER_ACTIVE)
     coord._fPendingScanNowTriples.add(OUTER_PENDING)
-    if way_out in ('deadline', 'out of time'):
-        after = end if way_out == 'deadline' else end + 0.1
+    after = {'deadline': end, 'out of time': end + 0.1, 'bad clock': 'soon'}.get(way_out)
+    if after is not None:
         sync.fScanners.Script(PRIMARY_SCOPE, (A, 'f'), [move_clock(monkeypatch, after)])
-    elif way_out == 'raises':
+    if way_out in ('raises', 'clean-up fails'):
         sync.fScanners.Script(PRIMARY_SCOPE, (A, 'g'), [Boom('scan failed')])
+    if way_out == 'clean-up fails':
+        sync.fCacheMgr.DoesCacheBufferExist = 5  # queueing what is left fails in C code
     needs = [T1, OUTER_ACTIVE, T2, T3]
-    if way_out == 'raises':
-        with pytest.raises(Boom):
+    raised = {'raises': Boom, 'clean-up fails': TypeError, 'bad clock': TypeError}.get(way_out)
+    if raised:
+        with pytest.raises(raised) as info:
             coord.TryToScanDictNow(A, 'f', needs, end)
+        # A failing clean-up keeps the scan's exception as its context.
+        assert isinstance(info.value.__context__, Boom) is (way_out == 'clean-up fails')
     else:
         assert coord.TryToScanDictNow(A, 'f', needs, end) is (way_out != 'out of time')
     assert sets(coord) == ({OUTER_ACTIVE}, {OUTER_PENDING})
     assert all(s.fDestroyCount == 1 for s in sync.fScanners.Made())
     # What was not scanned is queued, the scan that ran out of time too; reaching the
     # deadline exactly is not running out.
-    assert queued(coord) == {'finished': {}, 'deadline': {}, 'out of time': {T1: 1, T2: 1, T3: 1},
-                             'raises': {T2: 1, T3: 1}}[way_out]
+    assert queued(coord) == {'out of time': {T1: 1, T2: 1, T3: 1}, 'raises': {T2: 1, T3: 1},
+                             'bad clock': {T1: 1, T2: 1, T3: 1}}.get(way_out, {})
     assert (B, 'y') not in scanned(sync)
 
 

@@ -9,7 +9,14 @@ import weakref
 
 import pytest
 import singleton
-from doubles import AsyncLocation, FakeGuiMgr, LocalLocation, OtherDocument, make_source_editor
+from doubles import (
+    AsyncLocation,
+    FakeGuiMgr,
+    FakeLocationDataCache,
+    LocalLocation,
+    OtherDocument,
+    make_source_editor,
+)
 from ostrelbase import location
 from queue_helpers import *
 
@@ -80,6 +87,10 @@ def test_bad_arguments_change_nothing(queue):
              r'^First\(\) takes exactly 0 positional arguments \(1 given\)$')]:
         with pytest.raises(exc, match=message):
             call()
+    for name in ('Clear', '_destroy_impl', 'GetWaitingCount', '_CB_ActiveDocChanged',
+                 '_SignalEmitIdle'):
+        with pytest.raises(TypeError, match=rf'^{name}\(\) takes exactly 0 positional'):
+            getattr(queue, name)(1)
     assert snapshot(queue) == before
 
 
@@ -130,6 +141,28 @@ def test_name_without_order_sorts_as_order_zero(data_cache, capsys):
     q.AddScanPairs([(B, 'f')], T, 0)
     assert (q._fOrderedQueues[0].fPriority, q._fOrderedQueues[0].fOrder) == (0, 0)
     q.destroy()
+
+
+def test_moving_scans_between_single_queues(queue):
+    class Scope(str):  # compared through Python, not as exact str
+        pass
+
+    queue.AddScanPairs([(A, Scope('c')), (A, 'a'), (A, Scope('b'))], S)
+    first, second = queue._fOrderedQueues[0], queue._GetSingleQueue(S, 1)
+    assert first.fOrderedDict.get(A) == ['a', 'b', 'c']
+    queue._MoveScansBetweenQueues(A, None, second, first)  # nothing of A there to move
+    queue._MoveScansBetweenQueues(A, ['a', 'b', 'c'], first, second)
+    assert queued_scans(queue) == {(A, n, S): 1 for n in 'abc'}
+    second.fOrderedDict.Set(A, ('a',), True)
+    with pytest.raises(TypeError, match='^Expected list, got tuple$'):
+        queue._MoveScansBetweenQueues(A, ['a'], second, first)
+
+
+def test_totals_that_disagree_with_the_scans_are_reported(queue):
+    queue.AddScanPairs([(A, 'f')], S)
+    del queue._fPerScanNameCounts[S]
+    with pytest.raises(AssertionError):
+        queue.RemoveScanTriple((A, 'f', S))
 
 
 def test_scan_names_of_one_order_share_a_single_queue(data_cache):
@@ -191,7 +224,7 @@ def test_listing(queue, data_cache, capsys):
     assert listing(queue, limit=3)[4:] == [
         full[3], full[4], '    ...\n', '  ...\n', full[-1], '  ...\n']
     capsys.readouterr()
-    queue.PrintScanQueues()
+    queue.PrintScanQueues()  # to standard output by default
     assert capsys.readouterr().out == ''.join(listing(queue))
 
     queue.Clear()
@@ -286,6 +319,27 @@ def test_destroyed_queue_is_collected_despite_cycles(data_cache):
     gc.collect()
     assert [r() for r in refs] == [None, None]
     gui.destroy()
+
+
+def test_queues_in_cycles_through_their_locations_or_their_class_are_collected(async_probe):
+    class Loc(LocalLocation):
+        __slots__ = ('queue',)
+
+    cls = type('Queue', (sc._CScanQueue,), {})
+    q, loc = cls(FakeLocationDataCache()), Loc('a.py')
+    q.SetScansToOrder({S: 0})
+    loc.queue, cls.instance = q, q  # queue -> loc -> queue; queue -> class -> queue
+    q.AddScanPairs([(loc, 'f')], S)
+    q.UpdateForVisibleDocuments(loc, [])
+    cache = q._fLocationDataCache
+    singleton.ResetSingletons()  # the emitters it listens to go; it is never destroyed
+    cache.destroy()
+    run_idles()
+    async_probe.fCalls.clear()
+    refs = [weakref.ref(q), weakref.ref(cls)]
+    del q, loc, cls, cache
+    gc.collect()
+    assert [r() for r in refs] == [None, None]
 
 
 def test_parked_items_iterate_as_in_the_reference(data_cache):

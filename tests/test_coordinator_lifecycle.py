@@ -58,7 +58,8 @@ def test_constructor_arguments(host):
             getattr(c, name)(1)
     with pytest.raises(TypeError):
         c.TryToScanDictNow(A, 'f', [], 'soon')
-    assert c.TryToScanDictNow(A, 'f', [], -1.0) is False  # long past: a time, not an error
+    # -1.0 is a time long past, not an error.
+    assert c.TryToScanDictNow(A, 'f', [], -1.0) is False and c.TryToScanNow(A, 'f', [], -1.0) is None
     assert host.fLog == [] and c.QueuesEmpty()
     c.destroy()
     with pytest.raises(RuntimeError, match=r'^CScanCoordinator.__init__\(\) has not been called$'):

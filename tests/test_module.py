@@ -81,6 +81,14 @@ class TestInitialisation:
         # The loaded module is untouched.
         assert sc._CScanQueue.__name__ == '_CScanQueue'
 
+    def test_without_a_package_the_engines_modules_are_bound(self):
+        code = 'import sys; sys.path.insert(0, sys.argv[1]); import scancoordinator as m; ' \
+               'print(m.analysis.__name__)'
+        env = dict(os.environ, PYTHONPATH=os.pathsep.join(p for p in sys.path if p))
+        out = subprocess.run([sys.executable, '-c', code, os.path.dirname(sc.__file__)],
+                             capture_output=True, text=True, timeout=120, env=env, check=False)
+        assert out.stdout == 'pysource.analysis\n', out.stderr
+
     def test_second_interpreter_gets_import_error(self):
         code = textwrap.dedent('''
             import _xxsubinterpreters as interpreters

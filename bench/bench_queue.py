@@ -50,7 +50,7 @@ def load(impl):
     if impl == 'compiled':
         from pysource import scancoordinator
         return scancoordinator
-    from reference import scanqueue
+    import reference_queue as scanqueue
     return scanqueue
 
 

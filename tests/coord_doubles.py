@@ -1,54 +1,47 @@
-"""Scripted stand-ins for the scan coordinator's collaborators, and test helpers.
+"""Scripted stand-ins for the scan coordinator's collaborators.
 
-Every double writes the calls made on it into one shared `CallLog`, so a test
-can check the order of calls across collaborators (cache manager, helper proxy,
-main loop, signals) as well as their arguments.  Answers come from plain
-attributes the test sets; a double can be told to raise from one operation
-(`Fail`), or to run a probe while one of its operations is being called
-(`Probe`), which is how tests look at the coordinator's state mid-operation.
-
-Signal emitters derive from the host's CDestroyable so that the coordinator
-connects to them exactly as it does in the application.  Locations are the
-stand-in host's own: `local()` makes a `CLocalFileLocation`, `remote()` a
-remote-agent location (whose data arrives asynchronously).
-
-The coordinator is tested in two flavours, the class itself and
-`CountingCoordinator`, a Python subclass that overrides the overridable
-operations, records each call and delegates to the base class; a test that
-runs on the counting flavour can therefore check which of its own operations
-the coordinator called and with what.
+Every double records its calls in one shared `CallLog` (so a test can check the
+order of calls across collaborators), answers from attributes the test sets,
+and can be told to raise (`Fail`) or to run a probe when called (`Probe`).
+`Host.Patch` replaces the scanner classes the coordinator looks up on
+`pysource.scopescanner` with scripted ones (each `Scan` answers the next entry of
+its script: a state, an exception to raise, or `fn(scanner, end_time)`; the last
+repeats), the logger with a `RecordingLogger`, and the exception reporter.
 """
 import collections
-import gc
+import io
 import re
-import weakref
+import sys
+import time
 from types import SimpleNamespace
 
 import pytest
 import singleton
-from cache import textcache
 from doubles import FakeGuiMgr, FakeLocationDataCache
 from guiutils import ostrelgtk
-from ostrelbase import containers, destroyable, location, remoteclient
+from ostrelbase import destroyable, location
+from ostrelutils import reflect
 
-from pysource import analysis, scancoordinator, scopeinfo
+from pysource import _fastaccess, analysis, scancoordinator, scopeinfo, scopescanner, symbolinfo
 
-__all__ = [
-    'coord',
-    'coord_cls',
-    'gtk_spy',
-    'host',
-    'host_reset',
-]
+__all__ = ['DERIVED', 'IDLE_PRIORITY', 'PRIMARY', 'PRIMARY_SCOPE', 'PRIMARY_WHOLE',
+           'SECONDARY_SCOPE', 'SECONDARY_WHOLE', 'Analysis', 'Boom', 'CScanCoordinator',
+           'CScanItem', 'FileAttribMgr', 'Host', 'active', 'add_incomplete', 'class_def',
+           'data_waiting', 'end_in', 'helper_callback_class', 'kFinishedScanning', 'kReadyToScan',
+           'kScanAbandoned', 'kTimedOut', 'kWaitingForData', 'local', 'make_coord', 'method_def',
+           'pending_callbacks', 'queued', 'record_signals', 'remote', 'scope_info', 'signals_of',
+           'take_over_idle', 'waiting']
 
 PRIMARY = 'scope-primary'
 DERIVED = 'scope-derived'
 IDLE_PRIORITY = 150
-
 CScanCoordinator = scancoordinator.CScanCoordinator
-kTypingModulePriority = scancoordinator.kTypingModulePriority
-kInteractivePriority = scancoordinator.kInteractivePriority
-kBackgroundPriority = scancoordinator.kBackgroundPriority
+CScanItem = scancoordinator.CScanItem
+kReadyToScan = scopescanner.kReadyToScan
+kWaitingForData = scopescanner.kWaitingForData
+kFinishedScanning = scopescanner.kFinishedScanning
+kTimedOut = scopescanner.kTimedOut
+kScanAbandoned = scopescanner.kScanAbandoned
 
 
 def local(name):
@@ -63,84 +56,233 @@ class Boom(Exception):
     """Raised by a double that was told to fail."""
 
 
-# ---- the shared call log ------------------------------------------------------
-
 Call = collections.namedtuple('Call', 'who what args kwargs')
 
 
 class CallLog(list):
-    """Calls made on the doubles, in order, as `Call(who, what, args, kwargs)`."""
-
     def add(self, who, what, *args, **kwargs):
         self.append(Call(who, what, args, kwargs))
 
     def find(self, who=None, what=None):
-        return [c for c in self if (who is None or c.who == who)
-                and (what is None or c.what == what)]
+        return [c for c in self if who in (None, c.who) and what in (None, c.what)]
 
     def args(self, who, what):
-        """The positional arguments of every call of `who.what`, in order."""
         return [c.args for c in self.find(who, what)]
 
-    def names(self, who=None):
-        return [(c.who, c.what) for c in self if who is None or c.who == who]
 
-
-class _Scripted:
-    """Recording, failing and probing for the doubles' operations."""
-
+class Scripted:
     def _InitScripted(self, log, who):
-        self.fLog = log
-        self.fWho = who
-        self.fFailures = {}
-        self.fProbes = {}
+        self.fLog, self.fWho, self.fFailures, self.fProbes = log, who, {}, {}
 
     def Fail(self, what, exc):
         """The next calls of `what` raise `exc` (None: stop failing)."""
-        if exc is None:
-            self.fFailures.pop(what, None)
-        else:
-            self.fFailures[what] = exc
+        self.fFailures[what] = exc
 
     def Probe(self, what, fn):
-        """Call `fn(*args, **kwargs)` whenever `what` is called (after recording)."""
         self.fProbes[what] = fn
 
     def _Record(self, what, *args, **kwargs):
         self.fLog.add(self.fWho, what, *args, **kwargs)
-        probe = self.fProbes.get(what)
-        if probe is not None:
-            probe(*args, **kwargs)
-        exc = self.fFailures.get(what)
-        if exc is not None:
-            raise exc
+        if what in self.fProbes:
+            self.fProbes[what](*args, **kwargs)
+        if self.fFailures.get(what) is not None:
+            raise self.fFailures[what]
 
 
-# ---- the analysis manager and what hangs off it ------------------------------------
+PRIMARY_WHOLE, PRIMARY_SCOPE = 'CWholeFilePrimaryScanner', 'CSingleScopePrimaryScanner'
+SECONDARY_WHOLE, SECONDARY_SCOPE = 'CWholeFileSecondaryScanner', 'CSingleScopeSecondaryScanner'
 
-class FakeModFileCache(destroyable.CDestroyable, _Scripted):
-    """The factory's module file cache: only its "suspend"/"unsuspend" signals matter."""
+
+def add_incomplete(names, state=kFinishedScanning):
+    """A script entry that adds scope names to the scanner's incomplete set."""
+    def step(scanner, end_time):
+        scanner.fKwargs['incomplete_scope_set'].update(names)
+        return state
+    return step
+
+
+class _Scanner:
+    kKind = fKit = None
+
+    def _Setup(self, key, args, kwargs):
+        destroyable.CDestroyable.__init__(self, ('scan-state-changed',))
+        self.fKey, self.fArgs, self.fKwargs = key, args, kwargs
+        script = self.fKit.fScripts.get((self.kKind, key)) or self.fKit.Script(None, None)
+        self.fScript, self.fStates = script, list(script.states)
+        self.fInfo, self.fScopeDef = script.info, script.scope_def
+        self.fContainingClassDef = script.containing_class_def
+        self.fFileDoesntExist = script.file_doesnt_exist
+        self.fScans, self.fSaves, self.fDestroyCount = [], [], 0
+        self.fKit.fCreated.append(self)
+        self.fKit.fLog.add('scanner', 'create', self.kKind, key)
+
+    def __repr__(self):
+        return f'<{self.kKind} of {self.fKey!r}>'
+
+    def Scan(self, end_time):
+        self.fKit.fLog.add('scanner', 'Scan', self.kKind, self.fKey, end_time)
+        step = self.fStates.pop(0) if len(self.fStates) > 1 else self.fStates[0]
+        self.fScans.append(end_time)
+        if isinstance(step, BaseException):
+            raise step
+        return step(self, end_time) if callable(step) else step
+
+    def SaveToInfoCache(self, *args):
+        self.fSaves.append(args)
+        self.fKit.fLog.add('scanner', 'SaveToInfoCache', self.kKind, self.fKey)
+        return self.fScript.changed
+
+    def _destroy_impl(self):
+        self.fDestroyCount += 1
+        self.fKit.fLog.add('scanner', 'destroy', self.kKind, self.fKey)
+
+    def Connections(self):
+        return sum(len(c) for c in (self._CDestroyable__fSignalCatchers or {}).values())
+
+
+class _WholeFilePrimary(_Scanner, destroyable.CDestroyable):
+    def __init__(self, loc, scan_name, *, incomplete_scope_set, log):
+        self._Setup(loc, (loc, scan_name), {'incomplete_scope_set': incomplete_scope_set,
+                                            'log': log})
+
+
+class _SingleScopePrimary(_Scanner, destroyable.CDestroyable):
+    def __init__(self, loc, scope_name, *, incomplete_scope_set, log):
+        self._Setup((loc, scope_name), (loc, scope_name),
+                    {'incomplete_scope_set': incomplete_scope_set, 'log': log})
+
+
+class _WholeFileSecondary(_Scanner, scopescanner.CScanner):
+    def __init__(self, loc, scan_name, log, /):
+        self._Setup(loc, (loc, scan_name, log), {})
+
+
+class _SingleScopeSecondary(_Scanner, destroyable.CDestroyable):
+    def __init__(self, scope_info, log, ctx, ana_mgr, /):
+        self._Setup((scope_info.key.loc, scope_info.key.scope_name),
+                    (scope_info, log, ctx, ana_mgr), {})
+
+
+class ScannerKit:
+    def __init__(self, log):
+        self.fLog, self.fScripts, self.fCreated = log, {}, []
+        bases = {PRIMARY_WHOLE: _WholeFilePrimary, PRIMARY_SCOPE: _SingleScopePrimary,
+                 SECONDARY_WHOLE: _WholeFileSecondary, SECONDARY_SCOPE: _SingleScopeSecondary}
+        self.fClasses = {kind: type(kind, (base,), {'fKit': self, 'kKind': kind})
+                         for kind, base in bases.items()}
+
+    def Script(self, kind, key, states=(kFinishedScanning,), info=None, scope_def=None,
+               containing_class_def=None, file_doesnt_exist=False, changed=True):
+        self.fScripts[(kind, key)] = script = SimpleNamespace(
+            states=list(states), info=info, scope_def=scope_def, changed=changed,
+            containing_class_def=containing_class_def, file_doesnt_exist=file_doesnt_exist)
+        return script
+
+    def Made(self, kind=None):
+        return [s for s in self.fCreated if kind in (None, s.kKind)]
+
+    def One(self, kind=None):
+        [made] = self.Made(kind)
+        return made
+
+
+def scope_info(loc, scope_name, type_equivs=None, def_info=b'', mtime=100.0):
+    key = scopeinfo.CScopeInfoKey(loc, scope_name, PRIMARY, loc, scope_name)
+    return scopeinfo.CScopeInfo(key, def_info, mtime, False, False, type_equivs or {})
+
+
+def method_def(scope_name, bound=False):
+    prefix = symbolinfo.kMethodPrefix if bound else symbolinfo.kUnboundMethodPrefix
+    return symbolinfo.PackDefInfoStr(prefix, scope_name, 3, 5, ('self',))
+
+
+def class_def(scope_name):
+    return symbolinfo.PackDefInfoStr(symbolinfo.kClassPrefix, scope_name, 1, 9)
+
+
+class LocCache(Scripted):
+    """Answers `WantDerivedInfo` from `fAnswers` (default True)."""
 
     def __init__(self, log):
-        destroyable.CDestroyable.__init__(self, ('suspend', 'unsuspend'))
-        self._InitScripted(log, 'mod_file_cache')
+        self._InitScripted(log, 'loc_cache')
+        self.fAnswers = {}
+        self.fBuiltinLoc = local('stubs/builtins.pyi')
+
+    def WantDerivedInfo(self, loc):
+        self._Record('WantDerivedInfo', loc)
+        return self.fAnswers.get(loc, True)
+
+    def GetBuiltinLoc(self):
+        self._Record('GetBuiltinLoc')
+        return self.fBuiltinLoc
 
 
-class FakeAnalysisFactory(destroyable.CDestroyable, _Scripted):
-    """Finds the builtins and typing modules from `fBuiltinMod`, `fLocsForName`
-    and `fTypingLocs`."""
+class InfoCache(scopeinfo.CInfoCache, Scripted):
+    """`fMTimes` (loc -> disk time, default 100.0), `fScansDone` (loc -> string; or the
+    whole answer in `fScansDoneResult`), `fImports` (loc -> equivalents), `fScopeInfos`
+    ((loc, scope) -> info; None for any other pair unless `fMakeInfos`)."""
+
+    def __init__(self, log):
+        scopeinfo.CInfoCache.__init__(self, PRIMARY, DERIVED, loc_cache=LocCache(log))
+        self._InitScripted(log, 'info_cache')
+        self.fMTimes, self.fScansDone, self.fImports, self.fScopeInfos = {}, {}, {}, {}
+        self.fScansDoneResult = None
+        self.fMakeInfos, self.fStore, self.fAdded = True, True, []
+
+    def GetScansDoneForMultipleFiles(self, mtime_dict):
+        self._Record('GetScansDoneForMultipleFiles', dict(mtime_dict))
+        if self.fScansDoneResult is not None:
+            return self.fScansDoneResult
+        return {loc: self.fScansDone.get(loc, '') for loc in mtime_dict}
+
+    def GetAllImports(self, loc_list):
+        self._Record('GetAllImports', list(loc_list))
+        return [(loc, 'scope', eq) for loc in loc_list for eq in self.fImports.get(loc, ())]
+
+    def GetDiskMTime(self, loc):
+        self._Record('GetDiskMTime', loc)
+        return self.fMTimes.get(loc, 100.0)
+
+    def GetScopeInfo(self, loc, scope_name):
+        self._Record('GetScopeInfo', loc, scope_name)
+        if (loc, scope_name) not in self.fScopeInfos and self.fMakeInfos:
+            self.fScopeInfos[(loc, scope_name)] = scope_info(loc, scope_name)
+        return self.fScopeInfos.get((loc, scope_name))
+
+    def Put(self, info):
+        self.fScopeInfos[(info.key.loc, info.key.scope_name)] = info
+        return info
+
+    def AddScopeInfo(self, info):
+        self._Record('AddScopeInfo', info)
+        self.fAdded.append(info)
+        if self.fStore:
+            self.Put(info)
+
+    def FinishedWithScans(self, loc, scope_name, scan_name):
+        self._Record('FinishedWithScans', loc, scope_name, scan_name)
+
+    def Trim(self):
+        self._Record('Trim')
+
+    def WriteToDatabase(self):
+        self._Record('WriteToDatabase')
+
+
+class AnalysisFactory(destroyable.CDestroyable, Scripted):
+    """Builtins from `fBuiltinMod`/`fLocsForName`, typing modules from `fTypingLocs`,
+    module files from `fModuleLocs`, secondary locations from `fSecondaryLocs`."""
 
     def __init__(self, log):
         destroyable.CDestroyable.__init__(self, ('import-resolution-changed',))
         self._InitScripted(log, 'factory')
-        self._fModFileCache = FakeModFileCache(log)
-        self.fBuiltinMod = None
-        self.fLocsForName = {}
-        self.fTypingLocs = None
+        self._fModFileCache = destroyable.CDestroyable(('suspend', 'unsuspend'))
+        self.fBuiltinMod, self.fTypingLocs = None, None
+        self.fLocsForName, self.fModuleLocs, self.fSecondaryLocs = {}, {}, {}
 
-    def SetBuiltins(self, local_name, locs):
-        self.fBuiltinMod = SimpleNamespace(fLocalName=local_name)
-        self.fLocsForName[local_name] = list(locs)
+    def SetBuiltins(self, name, locs):
+        self.fBuiltinMod = SimpleNamespace(fLocalName=name)
+        self.fLocsForName[name] = list(locs)
 
     def FindBuiltinMod(self):
         self._Record('FindBuiltinMod')
@@ -148,83 +290,47 @@ class FakeAnalysisFactory(destroyable.CDestroyable, _Scripted):
 
     def GetAllLocsForName(self, name, dirloc=None, include_extensions=False):
         self._Record('GetAllLocsForName', name, dirloc, include_extensions)
-        # A generator: the caller must take what it needs while extending its list.
         return (loc for loc in self.fLocsForName.get(name, ()))
 
     def GetTypingLocations(self):
         self._Record('GetTypingLocations')
         return self.fTypingLocs
 
+    def _FindPrimaryLocsForNames(self, names, dirloc, flag):
+        self._Record('_FindPrimaryLocsForNames', set(names), dirloc, flag)
+        return [self.fModuleLocs.get(name) for name in sorted(names)]
+
+    def GetSecondaryLocations(self, loc):
+        self._Record('GetSecondaryLocations', loc)
+        return self.fSecondaryLocs.get(loc)
+
     def _destroy_impl(self):
         self._fModFileCache.destroy()
 
 
-class FakeLocCache(_Scripted):
-    """Answers `WantDerivedInfo` from `fAnswers` (loc -> any value), True otherwise."""
+class Buffer(Scripted):
+    def __init__(self, log, loc, modified, mtime):
+        self._InitScripted(log, 'buffer')
+        self.fLocation, self.fModified, self.fMTime = loc, modified, mtime
 
-    def __init__(self, log):
-        self._InitScripted(log, 'loc_cache')
-        self.fAnswers = {}
+    def IsModified(self):
+        self._Record('IsModified', self.fLocation)
+        return self.fModified
 
-    def WantDerivedInfo(self, loc):
-        self._Record('WantDerivedInfo', loc)
-        return self.fAnswers.get(loc, True)
-
-
-class FakeInfoCache(scopeinfo.CInfoCache):
-    """The host's information cache (the coordinator checks for that class) with a
-    scripted location cache."""
-
-    def __init__(self, log):
-        super().__init__(PRIMARY, DERIVED, loc_cache=FakeLocCache(log))
+    def _GetLastKnownModTime(self):
+        self._Record('_GetLastKnownModTime', self.fLocation)
+        return self.fMTime
 
 
-class FakeHelperProxy(_Scripted):
-    """The helper process's proxy: records the work handed to it."""
-
-    def __init__(self, log):
-        self._InitScripted(log, 'helper')
-        self.fReceived = []
-
-    def AddPairsToPrimaryQueue(self, pairs, *args, **kwargs):
-        # The pairs object is recorded as given, with its items, so that a test can
-        # check both what was sent and that the pairs themselves were passed on.
-        items = list(pairs)
-        self.fReceived.extend(items)
-        self._Record('AddPairsToPrimaryQueue', items, *args, **kwargs)
-
-    def FlushQueue(self, *args, **kwargs):
-        self._Record('FlushQueue', *args, **kwargs)
-
-
-class FakeAnalysisMgr:
-    """The analysis manager: scan names, services, Python path and helper process."""
-
-    def __init__(self, log, info_cache, data_cache, factory, python_path):
-        self.fLog = log
-        self.fPrimaryScanName = PRIMARY
-        self.fDerivedScanName = DERIVED
-        self.fInfoCache = info_cache
-        self.fInferenceEngine = SimpleNamespace(name='inference engine')
-        self.fLocationDataCache = data_cache
-        self.fAnalysisFactory = factory
-        self.fPyConfig = SimpleNamespace(python_path_locs=list(python_path))
-        self.fHelperProcessProxy = None
-        self._fHelperProcessSupport = None
-        self.fScanCoordinator = None
-
-
-# ---- application singletons ---------------------------------------------------------
-
-class FakeCacheMgr(_Scripted):
-    """Open buffers come from `fBuffers` (loc -> buffer)."""
+class CacheMgr(Scripted):
+    """Open buffers from `fBuffers`, analysis objects from `fAnalyses`."""
 
     def __init__(self, log):
         self._InitScripted(log, 'cache_mgr')
-        self.fBuffers = {}
+        self.fBuffers, self.fAnalyses = {}, {}
 
-    def OpenBuffer(self, loc):
-        self.fBuffers[loc] = SimpleNamespace(fLocation=loc)
+    def OpenBuffer(self, loc, modified=False, mtime=50.0):
+        self.fBuffers[loc] = Buffer(self.fLog, loc, modified, mtime)
 
     def DoesCacheBufferExist(self, loc, loaded_only=True):
         self._Record('DoesCacheBufferExist', loc, loaded_only)
@@ -233,18 +339,15 @@ class FakeCacheMgr(_Scripted):
     def _ClearEOLBlindCacheAndScans(self):
         self._Record('_ClearEOLBlindCacheAndScans')
 
+    def GetAnalysis(self, loc, create):
+        self._Record('GetAnalysis', loc, create)
+        return self.fAnalyses.get(loc)
+
     def GetSourceForScan(self, loc):
         return None
 
 
-class FakeSavableMgr(destroyable.CDestroyable):
-    def __init__(self):
-        destroyable.CDestroyable.__init__(self, ('external-files-changed',))
-
-
-class FakeFileAttribMgr(_Scripted):
-    """Probable mime types from `fMimeTypes` (loc -> mime type; None when absent)."""
-
+class FileAttribMgr(Scripted):
     def __init__(self, log):
         self._InitScripted(log, 'file_attrib_mgr')
         self.fMimeTypes = {}
@@ -253,58 +356,120 @@ class FakeFileAttribMgr(_Scripted):
         self._Record('GetMultipleProbableMimeTypes', list(loc_dict.items()))
         for loc in list(loc_dict):
             loc_dict[loc] = self.fMimeTypes.get(loc)
-        return 'ignored'
 
 
-class FakePrefMgr:
-    pass
+class HelperProxy(Scripted):
+    def __init__(self, log):
+        self._InitScripted(log, 'helper')
+
+    def AddPairsToPrimaryQueue(self, pairs, *args, **kwargs):
+        self._Record('AddPairsToPrimaryQueue', list(pairs), *args, **kwargs)
+
+    def FlushQueue(self, *args, **kwargs):
+        self._Record('FlushQueue', *args, **kwargs)
 
 
-class FakeAnalysis(analysis.CPySourceAnalysis):
-    """An analysis whose scopes per line come from `fScopeByLine` (lineno -> name)."""
+class Analysis(analysis.CPySourceAnalysis):
+    """An analysis whose scopes per line come from `fScopeByLine`."""
 
     def __init__(self, loc, log, scope_by_line=None):
-        self.fCallLog = log
-        self.fScopeByLine = dict(scope_by_line or {})
+        self.fCallLog, self.fScopeByLine, self.fBuilt = log, dict(scope_by_line or {}), False
         super().__init__(loc)
+        self.fBuilt = True
 
     def UpdateFromCache(self):
-        pass
+        if self.fBuilt:
+            self.fCallLog.add('analysis', 'UpdateFromCache', self.fLocation)
 
     def FindScopeContainingLine(self, lineno):
         self.fCallLog.add('analysis', 'FindScopeContainingLine', lineno)
         return self.fScopeByLine.get(lineno, '')
 
 
-# ---- the whole host -------------------------------------------------------------
+class Engine(Scripted):
+    """The inference engine: scope information from `fInfos`; the contexts'
+    `OutOfTime()` answers come from `fOutOfTime` in order (the last repeats)."""
 
-class CoordHost:
+    def __init__(self, log):
+        self._InitScripted(log, 'engine')
+        self.fInfos, self.fOutOfTime, self.fContexts = {}, [False], []
+
+    def NewContext(self, end_time):
+        self._Record('NewContext', end_time)
+        engine = self
+        ctx = SimpleNamespace(fEndTime=end_time, OutOfTime=lambda: (
+            engine.fOutOfTime.pop(0) if len(engine.fOutOfTime) > 1 else engine.fOutOfTime[0]))
+        self.fContexts.append(ctx)
+        return ctx
+
+    def GetScopeInfo(self, loc, scope_name, ctx):
+        self._Record('GetScopeInfo', loc, scope_name, ctx)
+        return self.fInfos.get((loc, scope_name))
+
+
+class RecordingLogger(_fastaccess.CLogger):
+    """Records every call as (format, values); logging is on (an in-memory file)."""
+
+    fOutputFile = None
+
+    def __init__(self, category):
+        super().__init__(category)
+        self.fCalls, self.fOutputFile = [], io.StringIO()
+
+    def __call__(self, msg, *values):
+        self.fCalls.append((msg, values))
+
+    def Texts(self):
+        return [msg % values if values else msg for msg, values in self.fCalls]
+
+    def Messages(self):
+        """The coordinator's own messages, without the queue listing."""
+        return [t for t in self.Texts()
+                if not t.startswith(('_CScanQueue contents:', ' ', 'Waiting for '))]
+
+
+class AnaMgr(SimpleNamespace):
+    """The analysis manager: scan names, services, Python path, helper process."""
+
+
+class Host:
     """One set of collaborators for a coordinator, sharing one call log."""
 
-    def __init__(self, python_path=True):
-        self.fLog = CallLog()
+    def __init__(self):
+        log = self.fLog = CallLog()
         self.fDataCache = FakeLocationDataCache()
-        self.fFactory = FakeAnalysisFactory(self.fLog)
+        self.fFactory = AnalysisFactory(log)
         self.fModFileCache = self.fFactory._fModFileCache
-        self.fInfoCache = FakeInfoCache(self.fLog)
+        self.fInfoCache = InfoCache(log)
         self.fLocCache = self.fInfoCache.fLocCache
-        self.fHelper = FakeHelperProxy(self.fLog)
-        self.fAnaMgr = FakeAnalysisMgr(self.fLog, self.fInfoCache, self.fDataCache,
-                                       self.fFactory,
-                                       [local('lib')] if python_path else [])
-        self.fPrefMgr = FakePrefMgr()
-        self.fCacheMgr = FakeCacheMgr(self.fLog)
-        self.fSavableMgr = FakeSavableMgr()
-        self.fFileAttribMgr = FakeFileAttribMgr(self.fLog)
+        self.fHelper = HelperProxy(log)
+        self.fEngine = Engine(log)
+        self.fAnaMgr = AnaMgr(
+            fPrimaryScanName=PRIMARY, fDerivedScanName=DERIVED, fInfoCache=self.fInfoCache,
+            fInferenceEngine=self.fEngine, fLocationDataCache=self.fDataCache,
+            fAnalysisFactory=self.fFactory, fHelperProcessProxy=None,
+            fPyConfig=SimpleNamespace(python_path_locs=[local('lib')]),
+            _fHelperProcessSupport=None, fScanCoordinator=None)
+        self.fCacheMgr = CacheMgr(log)
+        self.fSavableMgr = destroyable.CDestroyable(('external-files-changed',))
+        self.fFileAttribMgr = FileAttribMgr(log)
         self.fGuiMgr = FakeGuiMgr()
-
-    def Install(self):
-        """Make these the application's managers."""
-        for name, obj in (('fPrefMgr', self.fPrefMgr), ('fCacheMgr', self.fCacheMgr),
+        self.fScanners = ScannerKit(log)
+        for name, obj in (('fPrefMgr', object()), ('fCacheMgr', self.fCacheMgr),
                           ('fSavableMgr', self.fSavableMgr),
-                          ('fFileAttribMgr', self.fFileAttribMgr),
-                          ('fGuiMgr', self.fGuiMgr), ('fAnalysisMgr', self.fAnaMgr)):
+                          ('fFileAttribMgr', self.fFileAttribMgr), ('fGuiMgr', self.fGuiMgr),
+                          ('fAnalysisMgr', self.fAnaMgr)):
             singleton.SetSingleton(name, obj)
+
+    def Patch(self, monkeypatch):
+        """Scanner doubles, the recording logger and exception reports; what is patched
+        in refers to the call log only, so that it keeps no coordinator alive."""
+        for kind, cls in self.fScanners.fClasses.items():
+            monkeypatch.setattr(scopescanner, kind, cls)
+        monkeypatch.setattr(_fastaccess, 'CLogger', RecordingLogger)
+        log = self.fLog
+        monkeypatch.setattr(reflect, 'ReportCurrentException',
+                            lambda *args: log.add('reflect', 'report', sys.exc_info()[1]))
         return self
 
     def UseHelper(self, on=True):
@@ -313,297 +478,100 @@ class CoordHost:
     def SetPythonPath(self, locs):
         self.fAnaMgr.fPyConfig.python_path_locs = list(locs)
 
+    def Reports(self):
+        return [c.args[0] for c in self.fLog.find('reflect')]
+
     def Destroy(self):
         for obj in (self.fFactory, self.fInfoCache, self.fSavableMgr, self.fGuiMgr,
                     self.fDataCache):
             obj.destroy()
 
 
-# ---- the coordinator flavours -------------------------------------------------------
-
-class CountingCoordinator(CScanCoordinator):
-    """Records every call of the overridable operations below in `fCalls`, as
-    (name, arguments...) with default arguments filled in, then delegates."""
-
-    def __init__(self, *args, **kwargs):
-        self.fCalls = []
-        super().__init__(*args, **kwargs)
-
-    def Called(self, name):
-        """The recorded argument tuples of every call of `name`, in order."""
-        return [c[1:] for c in self.fCalls if c[0] == name]
-
-    def Quitting(self):
-        self.fCalls.append(('Quitting',))
-        return super().Quitting()
-
-    def _destroy_impl(self):
-        self.fCalls.append(('_destroy_impl',))
-        return super()._destroy_impl()
-
-    def SuspendIdleScans(self):
-        self.fCalls.append(('SuspendIdleScans',))
-        return super().SuspendIdleScans()
-
-    def ResumeIdleScans(self):
-        self.fCalls.append(('ResumeIdleScans',))
-        return super().ResumeIdleScans()
-
-    def _CB_ActiveEditLinenoChanged(self, ana, new_lineno):
-        self.fCalls.append(('_CB_ActiveEditLinenoChanged', ana, new_lineno))
-        return super()._CB_ActiveEditLinenoChanged(ana, new_lineno)
-
-    def _CB_NeedsScanAdded(self, info_cache, needs_scan_added, priority):
-        self.fCalls.append(('_CB_NeedsScanAdded', info_cache, needs_scan_added, priority))
-        return super()._CB_NeedsScanAdded(info_cache, needs_scan_added, priority)
-
-    def AddNeedsScanSetToQueues(self, needs_scan_set):
-        self.fCalls.append(('AddNeedsScanSetToQueues', needs_scan_set))
-        return super().AddNeedsScanSetToQueues(needs_scan_set)
-
-    def _QueueBasicModules(self, end_time):
-        self.fCalls.append(('_QueueBasicModules', end_time))
-        return super()._QueueBasicModules(end_time)
-
-    def QueuesEmpty(self, include_waiting=True):
-        self.fCalls.append(('QueuesEmpty', include_waiting))
-        return super().QueuesEmpty(include_waiting)
-
-    def AddParseablesToQueue(self, loc_seq, priority=kBackgroundPriority):
-        loc_seq = list(loc_seq)
-        self.fCalls.append(('AddParseablesToQueue', loc_seq, priority))
-        return super().AddParseablesToQueue(loc_seq, priority)
-
-    def _CanSendToHelperProcess(self, loc, scope_name):
-        self.fCalls.append(('_CanSendToHelperProcess', loc, scope_name))
-        return super()._CanSendToHelperProcess(loc, scope_name)
-
-    def AddPairsToPrimaryQueue(self, pairs, first=True, priority=None):
-        pairs = list(pairs)
-        self.fCalls.append(('AddPairsToPrimaryQueue', pairs, first, priority))
-        return super().AddPairsToPrimaryQueue(pairs, first, priority)
-
-    def AddPairsToSecondaryQueue(self, pairs, first=True, priority=None):
-        pairs = list(pairs)
-        self.fCalls.append(('AddPairsToSecondaryQueue', pairs, first, priority))
-        return super().AddPairsToSecondaryQueue(pairs, first, priority)
-
-    def _CB_QueueLocationsAdded(self, queue, added):
-        self.fCalls.append(('_CB_QueueLocationsAdded', queue, added))
-        return super()._CB_QueueLocationsAdded(queue, added)
-
-    def _ScheduleIdle(self):
-        self.fCalls.append(('_ScheduleIdle',))
-        return super()._ScheduleIdle()
-
-    def _CancelIdle(self):
-        self.fCalls.append(('_CancelIdle',))
-        return super()._CancelIdle()
-
-    def LocationInPrimaryScanQueue(self, loc):
-        self.fCalls.append(('LocationInPrimaryScanQueue', loc))
-        return super().LocationInPrimaryScanQueue(loc)
-
-    def LocationInSecondaryScanQueue(self, loc):
-        self.fCalls.append(('LocationInSecondaryScanQueue', loc))
-        return super().LocationInSecondaryScanQueue(loc)
-
-    def LocationInScanQueues(self, loc):
-        self.fCalls.append(('LocationInScanQueues', loc))
-        return super().LocationInScanQueues(loc)
-
-    def RemoveLocationsFromQueue(self, to_remove):
-        self.fCalls.append(('RemoveLocationsFromQueue', to_remove))
-        return super().RemoveLocationsFromQueue(to_remove)
-
-    def FlushQueue(self):
-        self.fCalls.append(('FlushQueue',))
-        return super().FlushQueue()
-
-
-def counted(coord, name):
-    """The calls of `name` that a counting coordinator recorded; None for the class
-    itself, which records nothing."""
-    return coord.Called(name) if isinstance(coord, CountingCoordinator) else None
-
-
-def make_coord(cls, host, idle_priority=IDLE_PRIORITY):
+def make_coord(host, cls=CScanCoordinator, idle_priority=IDLE_PRIORITY):
     """A coordinator on `host`, with the scan orders the application sets."""
     coord = cls(idle_priority, host.fAnaMgr)
     coord._fScanQueue.SetScansToOrder({PRIMARY: 0, DERIVED: 1})
     return coord
 
 
-# ---- fixtures -----------------------------------------------------------------------
-
-@pytest.fixture(autouse=True)
-def host_reset():
-    """A fresh main loop and fresh singletons around every test."""
-    ostrelgtk.reset()
-    singleton.ResetSingletons()
-    yield
-    ostrelgtk.reset()
-    singleton.ResetSingletons()
-
-
 @pytest.fixture
-def host(host_reset):
-    h = CoordHost().Install()
+def host(monkeypatch):
+    h = Host().Patch(monkeypatch)
     yield h
     h.Destroy()
 
 
-@pytest.fixture(params=['class', 'counting-subclass'])
-def coord_cls(request):
-    return CScanCoordinator if request.param == 'class' else CountingCoordinator
-
-
 @pytest.fixture
-def coord(coord_cls, host):
-    c = make_coord(coord_cls, host)
+def coord(host):
+    c = make_coord(host)
     yield c
     if not c._CDestroyable__fDestroyed:
         c.destroy()
 
 
-class GtkSpy:
-    """Wraps the main loop's idle and timeout calls, logging them as 'gtk' calls."""
-
-    def __init__(self, monkeypatch, log):
-        self.fLog = log
-        for name in ('idle_add', 'idle_remove', 'timeout_add_while_alive', 'timeout_remove'):
-            monkeypatch.setattr(ostrelgtk, name, self._Wrap(name, getattr(ostrelgtk, name)))
-
-    def _Wrap(self, name, real):
-        def spy(*args, **kwargs):
-            result = real(*args, **kwargs)
-            self.fLog.add('gtk', name, *args, result=result, **kwargs)
-            return result
-        return spy
-
-    def IdleAdds(self, callback_name='_CB_DoIdleAnalysis'):
-        """The idle_add calls for callbacks of that name (the scan queue's own
-        deferred-signal idles are left out)."""
-        return [c for c in self.fLog.find('gtk', 'idle_add')
-                if getattr(c.args[0], '__name__', None) == callback_name]
+def queued(coord):
+    """Every ready scan: {(loc, scope, scan name): priority}."""
+    return {(loc, scope, scan): priority
+            for loc, (_counts, pending) in coord._fScanQueue._fPerLocationInfo.items()
+            for (scope, scan), priority in pending.items()}
 
 
-@pytest.fixture
-def gtk_spy(monkeypatch, host):
-    return GtkSpy(monkeypatch, host.fLog)
+def waiting(coord):
+    """Every scan parked until its location is inspected, as 4-tuples."""
+    return {tuple(item) for items, _check in coord._fScanQueue._fWaitingForInspectByLoc.values()
+            for item in items}
 
 
-# ---- observing the coordinator --------------------------------------------------------
-
-def pending_idle(sid):
-    """The main loop's pending idle source with that id, or None."""
-    src = ostrelgtk.GetMainLoop()._fSources.get(sid)
-    return src if src is not None and src.fIntervalMs is None else None
+def data_waiting(coord):
+    return {tuple(item) for item in coord._fScanQueue._fScanItemsWaitingForData}
 
 
-def analysis_idles(coord):
-    """The pending idle sources that would run the coordinator's idle analysis."""
+def active(coord, kind):
+    """The coordinator's unfinished scanners of that kind (PRIMARY_WHOLE, ...)."""
+    pattern = r'C(WholeFile|SingleScope)(Primary|Secondary)Scanner'
+    extent, role = re.fullmatch(pattern, kind).groups()
+    return dict(getattr(coord, f'_CScanCoordinator__fActive{role}{extent}Scanners'))
+
+
+def pending_callbacks(coord, name='_CB_DoIdleAnalysis'):
+    """The main loop's pending sources that would call `coord.<name>()`."""
     return [src for src in ostrelgtk.GetMainLoop()._fSources.values()
-            if src.fIntervalMs is None and getattr(src.fCallback, '__name__', None)
-            == '_CB_DoIdleAnalysis' and getattr(src.fCallback, '__self__', None) is coord]
+            if getattr(src.fCallback, '__name__', None) == name
+            and getattr(src.fCallback, '__self__', None) is coord]
 
 
 def record_signals(coord, log, *signals, probe=None):
-    """Log each emission of `signals` by `coord` as ('signal', name, args), with
-    `probe()`'s result as the keyword `state` when given."""
+    """Log each emission as ('signal', name, args), with `probe()` as keyword `state`."""
     def recorder(signal):
         def record(*args):
-            if probe is None:
-                log.add('signal', signal, *args)
-            else:
-                log.add('signal', signal, *args, state=probe())
+            log.add('signal', signal, *args, **({} if probe is None else {'state': probe()}))
         return record
     for signal in signals:
         coord.connect(signal, recorder(signal))
 
 
-def _scan_queue(obj):
-    return obj._fScanQueue if isinstance(obj, CScanCoordinator) else obj
+def signals_of(log):
+    return [c.what for c in log.find('signal')]
 
 
-def queued(obj):
-    """Every ready scan of a coordinator's (or a scan queue's) queue:
-    {(loc, scope, scan name): priority}."""
-    return {(loc, scope, scan): priority
-            for loc, (_counts, pending) in _scan_queue(obj)._fPerLocationInfo.items()
-            for (scope, scan), priority in pending.items()}
+def take_over_idle(coord):
+    """Remove the installed idle from the main loop, so that a test can call
+    `_CB_DoIdleAnalysis` itself (the id stays in `_fIdleProcId`)."""
+    ostrelgtk.idle_remove(coord._fIdleProcId)
 
 
-def waiting(obj):
-    """Every scan parked until its location is inspected, as 4-tuples."""
-    return {tuple(item) for items, _check in _scan_queue(obj)._fWaitingForInspectByLoc.values()
-            for item in items}
+def helper_callback_class(name='HelperCallbacks'):
+    """A new class of helper callback objects, recording its class-wide connections."""
+    def class_connect_while_alive(cls, signal, callback, owner):
+        cls.fConnects.append((signal, callback, owner))
+        real = destroyable.CDestroyable.__dict__['class_connect_while_alive']
+        return real.__get__(None, cls)(signal, callback, owner)
+
+    return type(name, (destroyable.CDestroyable,), {
+        '__init__': lambda self: destroyable.CDestroyable.__init__(
+            self, ('scan-queue-locs-added', 'scan-queue-locs-removed')),
+        'fConnects': [], 'class_connect_while_alive': classmethod(class_connect_while_alive)})
 
 
-# ---- the host's connection records --------------------------------------------------
-
-ConnInfo = collections.namedtuple('ConnInfo', 'id emitter signal handler owner ended')
-
-_kConnRepr = re.compile(r"<_Connection (\d+): (?:'([^']*)'|destroy hook)(.*)>")
-
-
-def handler_label(callback, coord):
-    """A readable name for a handler: 'self.X' for a method of the coordinator,
-    'NoArg(f)' / 'NoObj(f)' for the host's adapters, else the function's name."""
-    if isinstance(callback, ostrelgtk.NoArgCallback):
-        return f'NoArg({handler_label(callback.fFunc, coord)})'
-    if isinstance(callback, ostrelgtk.NoObjCallback):
-        return f'NoObj({handler_label(callback.fFunc, coord)})'
-    name = getattr(callback, '__name__', repr(callback))
-    if getattr(callback, '__self__', None) is coord:
-        return f'self.{name}'
-    return name
-
-
-def describe_connection(conn, emitter_label, coord):
-    """ConnInfo of one of the host's connection records, read from its repr and
-    from what it refers to (its callback, and weak references to emitter/owner)."""
-    m = _kConnRepr.match(repr(conn))
-    assert m, repr(conn)
-    refs = gc.get_referents(conn)
-    weak = [r() for r in refs if isinstance(r, weakref.ReferenceType)]
-    callbacks = [r for r in refs if callable(r) and not isinstance(r, weakref.ReferenceType)]
-    assert len(callbacks) <= 1, refs
-    handler = handler_label(callbacks[0], coord) if callbacks else None
-    owner = 'coord' if any(w is coord for w in weak[1:]) else ('other' if weak[1:] else None)
-    return ConnInfo(int(m.group(1)), emitter_label, m.group(2), handler, owner,
-                    m.group(3).endswith('ended'))
-
-
-def instance_connections(emitter, label, coord):
-    """The connections made on `emitter`, as ConnInfo, in the order they were made."""
-    catchers = emitter._CDestroyable__fSignalCatchers or {}
-    infos = [describe_connection(conn, label, coord)
-             for conns in catchers.values() for conn in conns]
-    return sorted(infos)
-
-
-class ClassConnectSpy:
-    """Wraps `class_connect_while_alive` of the classes the coordinator follows
-    class-wide, recording ConnInfo of each connection made."""
-
-    kClasses = (analysis.CPySourceAnalysis, textcache.CTextCache,
-                remoteclient.CRemoteServerManager, containers.CContainerInspectorManager)
-
-    def __init__(self, monkeypatch):
-        self.fMade = []
-        for cls in self.kClasses:
-            monkeypatch.setattr(cls, 'class_connect_while_alive',
-                                staticmethod(self._Wrap(cls, cls.class_connect_while_alive)))
-
-    def _Wrap(self, cls, real):
-        def spy(signal, callback, owner):
-            cid = real(signal, callback, owner)
-            self.fMade.append((cid, cls.__name__, signal, callback, owner))
-            return cid
-        return spy
-
-    def Connections(self, coord):
-        return [ConnInfo(cid, cls_name, signal, handler_label(callback, coord),
-                         'coord' if owner is coord else 'other', False)
-                for cid, cls_name, signal, callback, owner in self.fMade]
+def end_in(seconds=5.0):
+    return time.time() + seconds

@@ -1,61 +1,19 @@
-"""CScanCoordinator: the idle analysis loop.
-
-Covers a file's whole way from being reported parseable to the database write,
-run by the main loop; the slice's time budget; what a slice returns and emits;
-quitting and waiting for remote modules; the whole-file check against
-modification times and recorded scans; the recent-scan and non-Python skips;
-completion bookkeeping; secondary scans without a builtins module; the
-exception path (also under `python -O`) and recovery after a failure; logging.
-
-Tests that take `scoord` run on the class and on ScanCountingCoordinator (see
-scan_doubles); on the latter they also check the calls the loop made to the
-coordinator's own overridable operations.
-"""
+"""CScanCoordinator: the idle analysis loop, from a file reported parseable to the
+database write; budgets, results, messages, skips, the exception path."""
+import json
+import os
+import subprocess
+import sys
+import textwrap
 import time
 
 import pytest
 from coord_doubles import *
-from coord_doubles import (
-    DERIVED,
-    PRIMARY,
-    Boom,
-    GtkSpy,
-    analysis_idles,
-    kBackgroundPriority,
-    local,
-    make_coord,
-    queued,
-    record_signals,
-)
 from guiutils import ostrelgtk
-from scan_doubles import *
-from scan_doubles import (
-    PRIMARY_SCOPE,
-    PRIMARY_WHOLE,
-    SECONDARY_SCOPE,
-    SECONDARY_WHOLE,
-    ScanAnalysis,
-    ScanCountingCoordinator,
-    active,
-    data_waiting,
-    is_counting,
-    kFinishedScanning,
-    kReadyToScan,
-    kTimedOut,
-    kWaitingForData,
-    pending_callbacks,
-    run_optimised,
-    take_over_idle,
-    timed_slice,
-)
 
-from pysource import inferenceengine, scancoordinator, utils
+from pysource import analysis, inferenceengine, utils
 
-CScanItem = scancoordinator.CScanItem
-
-A = local('a.py')
-B = local('b.py')
-C = local('c.py')
+A, B, C = local('a.py'), local('b.py'), local('c.py')
 
 kEntering = 'Entering _CB_DoIdleAnalysis()'
 kQuittingMsg = 'Returning False from _CB_DoIdleAnalysis because Ostrel in quitting'
@@ -63,7 +21,6 @@ kEmptyMsg = ('Returning False from _CB_DoIdleAnalysis() because scan queue is em
              ' (not including waiting)')
 kNotEmptyMsg = 'Returning True from _CB_DoIdleAnalysis() because scan queue is not empty'
 kExceptionMsg = 'Exception raised in _CB_DoIdleAnalysis(); implicitly returning None'
-kOutOfTimeMsg = 'Out of time after whole file check'
 kNoLocMsg = 'loc is None in scan_item'
 
 
@@ -75,46 +32,25 @@ def scans_done(d):
     return f'__CheckWholeFiles scans_done_dict: {d!r}'
 
 
-def calls_of(host, *who):
-    """(who, what, args) of the calls on the given doubles, in order."""
-    return [(c.who, c.what, c.args) for c in host.fLog if c.who in who]
+def scanning(loc, kind='primary'):
+    return [f'{verb} {kind} whole file scan: {loc!r}' for verb in ('Starting', 'Finished')]
 
 
-@pytest.fixture
-def spy(monkeypatch, shost):
-    return GtkSpy(monkeypatch, shost.fLog)
-
-
-# ---- the road of one file ------------------------------------------------------------------
-
-def test_one_file_from_parseable_to_database_write(scoord, shost, spy):
-    shost.fFileAttribMgr.fMimeTypes[A] = 'text/x-python'
-    record_signals(scoord, shost.fLog, 'scheduled', 'end')
+def test_one_file_from_parseable_to_database_write(coord, host):
+    host.fFileAttribMgr.fMimeTypes[A] = 'text/x-python'
+    record_signals(coord, host.fLog, 'scheduled', 'end')
     t0 = time.time()
-
-    scoord.AddParseablesToQueue([A])
-    assert queued(scoord) == {(A, '*', PRIMARY): kBackgroundPriority}
-    assert len(analysis_idles(scoord)) == 1
-
+    coord.AddParseablesToQueue([A])
     assert ostrelgtk.run_until_idle(100)
 
-    primary = shost.fScanners.One(PRIMARY_WHOLE, A)
-    secondary = shost.fScanners.One(SECONDARY_WHOLE, A)
-    assert shost.fScanners.Made() == [primary, secondary]
-    assert primary.fArgs == (A, PRIMARY)
-    assert primary.fKwargs['log'] is scoord.fLog
-    assert secondary.fArgs == (A, DERIVED, scoord.fLog)
-    assert [s.state for s in primary.fScans + secondary.fScans] == [kFinishedScanning] * 2
+    primary, secondary = host.fScanners.Made()
+    assert (primary.kKind, secondary.kKind) == (PRIMARY_WHOLE, SECONDARY_WHOLE)
+    assert primary.fArgs == (A, PRIMARY) and primary.fKwargs['log'] is coord.fLog
+    assert secondary.fArgs == (A, DERIVED, coord.fLog)
     assert primary.fDestroyCount == secondary.fDestroyCount == 1
-
-    # What the collaborators were asked, in order (the builtins module is never
-    # found here, and the whole-file check finds nothing up to date).
-    calls = [c for c in calls_of(shost, 'info_cache', 'loc_cache', 'factory', 'scanner')
-             if (c[1] != 'FindBuiltinMod' and c[:2] != ('info_cache', 'GetAllImports'))
-             or c == ('info_cache', 'GetAllImports', ([A],))]
-    assert [c[:2] for c in calls if c[0] == 'scanner'] == [
-        ('scanner', 'create'), ('scanner', 'Scan'), ('scanner', 'destroy')] * 2
-    assert [c for c in calls if c[0] != 'scanner'] == [
+    assert [(c.who, c.what, c.args) for c in host.fLog
+            if c.who in ('info_cache', 'loc_cache', 'factory') and c.what != 'FindBuiltinMod'
+            and c.args != ([],)] == [
         ('info_cache', 'GetDiskMTime', (A,)),
         ('info_cache', 'GetScansDoneForMultipleFiles', ({A: 100.0},)),
         ('info_cache', 'GetAllImports', ([A],)),
@@ -126,658 +62,351 @@ def test_one_file_from_parseable_to_database_write(scoord, shost, spy):
         ('loc_cache', 'WantDerivedInfo', (A,)),
         ('info_cache', 'FinishedWithScans', (A, '*', DERIVED)),
         ('info_cache', 'Trim', ()),
-        ('info_cache', 'WriteToDatabase', ()),
-    ]
-
-    # The second slice is the one "locations-added" asked for, after the queue
-    # had already run dry.
-    assert scoord.fLog.Messages() == [
-        kEntering,
-        checking([(A, 2)]),
-        scans_done({A: ''}),
-        f'Starting primary whole file scan: {A!r}',
-        f'Finished primary whole file scan: {A!r}',
-        f'Starting secondary whole file scan: {A!r}',
-        f'Finished secondary whole file scan: {A!r}',
-        kNoLocMsg,
-        kEmptyMsg,
-        kEntering,
-        kNoLocMsg,
-        kEmptyMsg,
-    ]
-    assert [c.what for c in shost.fLog.find('signal')] == ['scheduled', 'end', 'scheduled', 'end']
-
-    done = scoord._fLastScanCompleted
-    assert set(done) == {A} and set(done[A]) == {('*', PRIMARY), ('*', DERIVED)}
-    assert t0 <= done[A][('*', PRIMARY)] <= primary.fScans[0].called_at
-    assert done[A][('*', PRIMARY)] <= done[A][('*', DERIVED)] <= secondary.fScans[0].called_at
-    assert dict(scoord._fScanTripleCompletedCount) == {(A, '*', PRIMARY): 1,
-                                                        (A, '*', DERIVED): 1}
-    assert scoord._CScanCoordinator__fCompletedLocs == {A}
-    assert scoord._fMTimeAtLastWholeFileCheck == {A: 100.0}
-    assert A not in scoord._fIncompleteScansByLoc
-    assert queued(scoord) == {} and scoord.QueuesEmpty()
-    assert all(active(scoord, kind) == {} for kind in (PRIMARY_WHOLE, SECONDARY_WHOLE))
-    assert scoord.fActiveScanItem is None
-    assert scoord._fIdleProcId is None and analysis_idles(scoord) == []
-    assert scoord._fIdleToWriteToDatabase is None
-    assert scoord._fActiveIdleStart == -1.0
-    # The status timeout was installed by the first slice and is still running.
-    assert ostrelgtk.GetMainLoop().has_source(scoord._CScanCoordinator__fStatusTimeout)
-
-    if is_counting(scoord):
-        item_p, item_s = CScanItem(A, '*', PRIMARY, 2), CScanItem(A, '*', DERIVED, 2)
-        assert [c[0] for c in scoord.Called('_DoSingleScan')] == [item_p, item_s]
-        assert [c[0] for c in scoord.Called('__DoPrimaryWholeFileScan')] == [item_p]
-        assert [c[0] for c in scoord.Called('__DoSecondaryWholeFileScan')] == [item_s]
-        assert scoord.Called('__GetModtimeDict') == [([A],)]
-        assert scoord.Called('AddPairsToSecondaryQueue') == [([(A, '*')], True, 2)]
-        assert scoord.Called('_ScheduleWriteToDatabaseIdle') == [(), ()]
-        assert scoord.Called('_CB_WriteToDatabase') == [()]
-        assert len(scoord.Called('_CB_DoIdleAnalysis')) == 2
+        ('info_cache', 'WriteToDatabase', ())]
+    # The second slice is the one "locations-added" asked for, after the queue ran dry.
+    assert coord.fLog.Messages() == [
+        kEntering, checking([(A, 2)]), scans_done({A: ''}), *scanning(A),
+        *scanning(A, 'secondary'), kNoLocMsg, kEmptyMsg, kEntering, kNoLocMsg, kEmptyMsg]
+    assert signals_of(host.fLog) == ['scheduled', 'end', 'scheduled', 'end']
+    done = coord._fLastScanCompleted[A]
+    assert t0 <= done[('*', PRIMARY)] <= done[('*', DERIVED)] <= time.time()
+    assert set(coord._fLastScanCompleted) == {A} and set(done) == {('*', PRIMARY), ('*', DERIVED)}
+    assert dict(coord._fScanTripleCompletedCount) == {(A, '*', PRIMARY): 1, (A, '*', DERIVED): 1}
+    assert coord._CScanCoordinator__fCompletedLocs == {A}
+    assert coord._fMTimeAtLastWholeFileCheck == {A: 100.0}
+    assert A not in coord._fIncompleteScansByLoc and coord.QueuesEmpty()
+    assert (coord.fActiveScanItem, coord._fIdleProcId, coord._fIdleToWriteToDatabase,
+            coord._fActiveIdleStart) == (None, None, None, -1.0)
+    assert ostrelgtk.GetMainLoop().has_source(coord._CScanCoordinator__fStatusTimeout)
 
 
-# ---- the slice's budget -----------------------------------------------------------------
-
-def first_scan_budget(coord, host):
-    """Queue one whole file, run one slice; the scanner's deadline minus the slice's
-    start, as an interval (the slice starts between the two times taken)."""
-    coord.AddPairsToPrimaryQueue([(A, '*')])
-    _result, t0, t1 = timed_slice(coord)
-    end_time = host.fScanners.One(PRIMARY_WHOLE, A).fScans[0].end_time
-    return end_time - t1, end_time - t0
-
-
-@pytest.mark.parametrize('engine_file, budget', [
-    ('/opt/app/pysource/inferenceengine.py', 0.1),
-    ('/opt/app/pysource/inferenceengine.pyc', 0.1),
-    ('/opt/app/pysource/inferenceengine.cpython-311-x86_64-linux-gnu.so', 0.05),
-    ('C:\\app\\pysource\\inferenceengine.cp311-win_amd64.pyd', 0.05),
-])
-def test_slice_budget_depends_on_a_compiled_inference_engine(scoord, shost, monkeypatch,
-                                                             engine_file, budget):
+@pytest.mark.parametrize('engine_file, budget', [('/opt/pysource/inferenceengine.py', 0.1),
+                                                 ('C:\\pysource\\inferenceengine.pyd', 0.05),
+                                                 ('/opt/pysource/inferenceengine.so', 0.05)])
+def test_the_slice_budget_depends_on_a_compiled_inference_engine(coord, host, monkeypatch,
+                                                                 engine_file, budget):
     monkeypatch.setattr(inferenceengine, '__file__', engine_file)
-    low, high = first_scan_budget(scoord, shost)
-    assert low - 1e-3 <= budget <= high + 1e-3, (low, high)
-    if is_counting(scoord):
-        [(end_time,)] = scoord.Called('__DoScans')
-        assert end_time == shost.fScanners.One(PRIMARY_WHOLE, A).fScans[0].end_time
+    coord.AddPairsToPrimaryQueue([(A, '*')])
+    t0 = time.time()
+    coord._CB_DoIdleAnalysis()
+    t1 = time.time()
+    [end_time] = host.fScanners.One(PRIMARY_WHOLE).fScans
+    assert end_time - t1 - 1e-3 <= budget <= end_time - t0 + 1e-3
 
 
-def test_optimised_interpreter_budget_and_exception_path():
-    """Under -O the budget is 0.05 s even with an uncompiled inference engine, and
-    an exception inside a slice is reported, logged and swallowed (None)."""
+def run_optimised(body):
+    """Run `body` in a fresh `python -O`; its last line of output is a JSON document."""
+    env = dict(os.environ, PYTHONPATH=os.pathsep.join(p for p in sys.path if p))
+    proc = subprocess.run([sys.executable, '-O', '-c', textwrap.dedent(body)],
+                          capture_output=True, text=True, env=env, timeout=60, check=False)
+    assert proc.returncode == 0, proc.stderr
+    return json.loads(proc.stdout.strip().splitlines()[-1])
+
+
+def test_under_python_O_the_budget_is_short_and_exceptions_are_swallowed():
     result = run_optimised('''
-        import json, time
-        import pytest, singleton
-        from guiutils import ostrelgtk
-        from coord_doubles import Boom, local, make_coord
-        from scan_doubles import (PRIMARY_WHOLE, ScanCountingCoordinator, ScanHost,
-                                  kFinishedScanning)
-        from pysource import inferenceengine, scancoordinator, utils
-
-        out = {'debug': __debug__, 'engine': inferenceengine.__file__}
-        for cls in (scancoordinator.CScanCoordinator, ScanCountingCoordinator):
-            ostrelgtk.reset()
-            singleton.ResetSingletons()
-            with pytest.MonkeyPatch.context() as mp:
-                host = ScanHost().Install().Patch(mp)
-                coord = make_coord(cls, host)
-                a, b = local('a.py'), local('b.py')
-                host.fScanners.Script(PRIMARY_WHOLE, b, [Boom('scan failed'),
-                                                         kFinishedScanning])
-                coord.AddPairsToPrimaryQueue([(a, '*')], priority=0)
-                coord.AddPairsToPrimaryQueue([(b, '*')], priority=1)
-                scheduled = coord._fIdleProcId is not None
-                t0 = time.time()
-                first = coord._CB_DoIdleAnalysis()
-                t1 = time.time()
-                end_time = host.fScanners.One(PRIMARY_WHOLE, a).fScans[0].end_time
-                res = {
-                    'budget': [end_time - t1, end_time - t0],
-                    'result': repr(first),
-                    'idle_cleared': coord._fIdleProcId is None,
-                    'was_scheduled': scheduled,
-                    'reports': [repr(e) for e in host.Reports()],
-                    'last_message': coord.fLog.Messages()[-1],
-                    'b_still_queued': coord.LocationInPrimaryScanQueue(b),
-                }
-                coord._ScheduleIdle()
-                ostrelgtk.run_until_idle(100)
-                res['recovered'] = (coord.QueuesEmpty()
-                                    and len(host.fScanners.Made(PRIMARY_WHOLE, b)) == 1)
-                out[cls.__name__] = res
-                coord.destroy()
-                host.Destroy()
+        import json, time, pytest
+        from coord_doubles import Boom, Host, PRIMARY_WHOLE, kFinishedScanning, local, make_coord
+        from ostrelutils import reflect
+        with pytest.MonkeyPatch.context() as mp:
+            host = Host().Patch(mp)
+            coord = make_coord(host)
+            a, b = local('a.py'), local('b.py')
+            host.fScanners.Script(PRIMARY_WHOLE, b, [Boom('scan failed'), kFinishedScanning])
+            coord.AddPairsToPrimaryQueue([(a, '*')], priority=0)
+            coord.AddPairsToPrimaryQueue([(b, '*')], priority=1)
+            t0 = time.time()
+            first = coord._CB_DoIdleAnalysis()
+            t1 = time.time()
+            end_time = host.fScanners.Made()[0].fScans[0]
+            out = {'debug': __debug__, 'budget': [end_time - t1, end_time - t0],
+                   'result': repr(first), 'idle': coord._fIdleProcId,
+                   'reports': [repr(e) for e in host.Reports()],
+                   'last': coord.fLog.Messages()[-1], 'b': coord.LocationInPrimaryScanQueue(b)}
+            def failing_report(*args):
+                raise RuntimeError('reporter broken')
+            mp.setattr(reflect, 'ReportCurrentException', failing_report)
+            host.fScanners.Script(PRIMARY_WHOLE, local('c.py'), [Boom('again')])
+            coord.AddPairsToPrimaryQueue([(local('c.py'), '*')], priority=0)
+            out['failing report'] = repr(coord._CB_DoIdleAnalysis())
         print(json.dumps(out))
     ''')
-    assert result['debug'] is False and result['engine'].endswith('.py')
-    for name in ('CScanCoordinator', 'ScanCountingCoordinator'):
-        res = result[name]
-        low, high = res['budget']
-        assert low - 1e-3 <= 0.05 <= high + 1e-3, res
-        # a finishes, b raises in the same slice.
-        assert res['result'] == 'None', res
-        assert res['was_scheduled'] and res['idle_cleared'], res
-        assert res['reports'] == ["Boom('scan failed')"], res
-        assert res['last_message'] == kExceptionMsg, res
-        assert res['b_still_queued'] and res['recovered'], res
+    low, high = result.pop('budget')
+    assert low - 1e-3 <= 0.05 <= high + 1e-3
+    assert result == {'debug': False, 'result': 'None', 'idle': None,
+                      'reports': ["Boom('scan failed')"], 'last': kExceptionMsg, 'b': True,
+                      'failing report': 'None'}
 
 
-# ---- what a slice returns --------------------------------------------------------------
-
-def test_slices_return_true_while_a_scan_goes_on(scoord, shost):
-    shost.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, kTimedOut, kFinishedScanning])
-    record_signals(scoord, shost.fLog, 'end')
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    sid = scoord._fIdleProcId
-    assert sid is not None
-
-    assert scoord._CB_DoIdleAnalysis() is True
-    assert scoord._CB_DoIdleAnalysis() is True
-    assert scoord._fIdleProcId == sid  # the idle stays installed
-    assert shost.fLog.find('signal') == []
-    scanner = shost.fScanners.One(PRIMARY_WHOLE, A)
-    assert active(scoord, PRIMARY_WHOLE) == {A: scanner}
-    assert queued(scoord) == {(A, '*', PRIMARY): 1}
-
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert scoord._fIdleProcId is None
-    assert [c.what for c in shost.fLog.find('signal')] == ['end']
-    assert shost.fScanners.Made(PRIMARY_WHOLE) == [scanner]
-    assert len(scanner.fScans) == 3
-    ends = [s.end_time for s in scanner.fScans]
-    assert ends == sorted(set(ends))  # one deadline per slice
-    assert scoord.fLog.Messages() == [
-        kEntering, checking([(A, 1)]), scans_done({A: ''}),
-        f'Starting primary whole file scan: {A!r}', kNotEmptyMsg,
-        kEntering, kNotEmptyMsg,
-        kEntering, f'Finished primary whole file scan: {A!r}',
-        f'Starting secondary whole file scan: {A!r}',
-        f'Finished secondary whole file scan: {A!r}', kNoLocMsg, kEmptyMsg]
-
-
-def test_waiting_items_end_the_idle_without_end_signal(scoord, shost):
-    shost.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData, kFinishedScanning])
-    record_signals(scoord, shost.fLog, 'end')
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert scoord._fIdleProcId is None
-    assert data_waiting(scoord) == {(A, '*', PRIMARY, 1)}
-    assert shost.fLog.find('signal') == []
-    assert scoord._fActiveIdleStart >= 0  # the run of slices is not over
-    assert scoord._fIdleToWriteToDatabase is not None
-    assert scoord.fLog.Messages()[-1] == kEmptyMsg
-
-
-def test_empty_queue_ends_schedule_one_database_write(scoord, shost, spy):
-    record_signals(scoord, shost.fLog, 'end')
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert [c.what for c in shost.fLog.find('signal')] == ['end', 'end']
-    assert len(pending_callbacks(scoord, '_CB_WriteToDatabase')) == 1
-    assert ostrelgtk.run_until_idle(10)
-    assert len(shost.fLog.find('info_cache', 'WriteToDatabase')) == 1
-    assert scoord.fLog.Messages() == [kEntering, kNoLocMsg, kEmptyMsg] * 2
-    if is_counting(scoord):
-        assert scoord.Called('_ScheduleWriteToDatabaseIdle') == [(), ()]
-        assert scoord.Called('QueuesEmpty').count((True,)) == 2
-
-
-def test_quitting_stops_the_next_slice(scoord, shost):
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    sid = scoord._fIdleProcId
-    scoord.Quitting()
-    shost.fLog.clear()
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert scoord.fLog.Texts() == [kEntering, kQuittingMsg]
-    assert scoord._fIdleProcId == sid
-    assert scoord._CScanCoordinator__fStatusTimeout is None
-    assert shost.fLog == []
-    assert queued(scoord) == {(A, '*', PRIMARY): 1}
-    if is_counting(scoord):
-        assert scoord.Called('__DoScans') == []
-        assert scoord.Called('_ScheduleWriteToDatabaseIdle') == []
-
-
-def test_waiting_for_remote_modules_does_no_work(scoord, shost):
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    shost.fModFileCache.emit('suspend')
-    shost.fLog.clear()
-    assert scoord._CB_DoIdleAnalysis() is True
-    assert scoord.fLog.Messages() == [kEntering, kNotEmptyMsg]
-    assert shost.fLog.find('info_cache') == [] and shost.fScanners.Made() == []
-    assert shost.fLog.find('factory') == []  # not even the builtins module
-
-    shost.fModFileCache.emit('unsuspend')
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert len(shost.fScanners.Made(PRIMARY_WHOLE, A)) == 1
-
-
-# ---- the builtins and typing modules ------------------------------------------------------
-
-def test_basic_modules_are_queued_by_the_first_slice_that_finds_them(scoord, shost):
-    builtins = local('stubs/builtins.pyi')
-    scoord.AddPairsToPrimaryQueue([(A, '*')], priority=2)
-    shost.fFactory.fBuiltinMod = None
-    scoord._CB_DoIdleAnalysis()
-    assert not scoord._fAllBasicModuleQueued
-
-    shost.fFactory.SetBuiltins('builtins', [builtins])
-    scoord.AddPairsToPrimaryQueue([(B, '*')], priority=2)
-    scoord._CB_DoIdleAnalysis()
-    assert scoord._fAllBasicModuleQueued
-    # Queued at priority 0 and scanned in the same slice, before B.
-    made = [s.fKey for s in shost.fScanners.Made(PRIMARY_WHOLE)]
-    assert made == [A, builtins, B]
-    finds = len(shost.fLog.find('factory', 'FindBuiltinMod'))
-    scoord._CB_DoIdleAnalysis()
-    assert len(shost.fLog.find('factory', 'FindBuiltinMod')) == finds
-    if is_counting(scoord):
-        assert len(scoord.Called('_QueueBasicModules')) == 2
-
-
-def test_basic_modules_that_report_true_end_the_slice(shost):
-    class EarlyCoordinator(ScanCountingCoordinator):
-        def _QueueBasicModules(self, end_time):
-            super()._QueueBasicModules(end_time)
-            return True
-
-    coord = make_coord(EarlyCoordinator, shost)
+def test_slices_return_true_while_a_scan_goes_on(coord, host):
+    host.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, kTimedOut, kFinishedScanning])
+    record_signals(coord, host.fLog, 'end')
     coord.AddPairsToPrimaryQueue([(A, '*')])
+    sid = coord._fIdleProcId
     assert coord._CB_DoIdleAnalysis() is True
-    assert coord.Called('__CheckWholeFiles') == []
-    assert shost.fLog.find('info_cache') == [] and shost.fScanners.Made() == []
-    coord.destroy()
+    assert coord._CB_DoIdleAnalysis() is True
+    scanner = host.fScanners.One()
+    assert coord._fIdleProcId == sid and active(coord, PRIMARY_WHOLE) == {A: scanner}
+    assert host.fLog.find('signal') == [] and queued(coord) == {(A, '*', PRIMARY): 1}
+    assert coord._CB_DoIdleAnalysis() is False
+    assert coord._fIdleProcId is None and signals_of(host.fLog) == ['end']
+    assert len(scanner.fScans) == 3 and scanner.fScans == sorted(set(scanner.fScans))
+    assert coord.fLog.Messages() == [
+        kEntering, checking([(A, 1)]), scans_done({A: ''}), scanning(A)[0], kNotEmptyMsg,
+        kEntering, kNotEmptyMsg, kEntering, scanning(A)[1], *scanning(A, 'secondary'),
+        kNoLocMsg, kEmptyMsg]
 
 
-# ---- the whole-file check ---------------------------------------------------------------
+def test_work_waiting_for_data_ends_the_idle_without_end(coord, host):
+    host.fScanners.Script(PRIMARY_WHOLE, A, [kWaitingForData, kFinishedScanning])
+    record_signals(coord, host.fLog, 'end')
+    coord.AddPairsToPrimaryQueue([(A, '*')])
+    assert coord._CB_DoIdleAnalysis() is False
+    assert data_waiting(coord) == {(A, '*', PRIMARY, 1)} and host.fLog.find('signal') == []
+    assert coord._fActiveIdleStart >= 0  # the run of slices is not over
+    assert coord._fIdleToWriteToDatabase is not None
+    assert coord._CB_DoIdleAnalysis() is False
+    assert len(pending_callbacks(coord, '_CB_WriteToDatabase')) == 1
 
-def test_whole_file_check(scoord, shost):
+
+def test_quitting_stops_the_next_slice(coord, host):
+    coord.AddPairsToPrimaryQueue([(A, '*')])
+    coord.Quitting()
+    host.fLog.clear()
+    assert coord._CB_DoIdleAnalysis() is False
+    assert coord.fLog.Texts() == [kEntering, kQuittingMsg] and host.fLog == []
+    assert coord._fIdleProcId is not None and coord._CScanCoordinator__fStatusTimeout is None
+
+
+def test_waiting_for_remote_modules_does_no_work(coord, host):
+    coord.AddPairsToPrimaryQueue([(A, '*')])
+    host.fModFileCache.emit('suspend')
+    host.fLog.clear()
+    assert coord._CB_DoIdleAnalysis() is True
+    assert coord.fLog.Messages() == [kEntering, kNotEmptyMsg] and host.fLog == []
+    host.fModFileCache.emit('unsuspend')
+    assert coord._CB_DoIdleAnalysis() is False
+    assert len(host.fScanners.Made()) == 2
+
+
+def test_basic_modules_are_queued_by_the_first_slice_that_finds_them(coord, host):
+    builtins = local('stubs/builtins.pyi')
+    coord.AddPairsToPrimaryQueue([(A, '*')], priority=2)
+    coord._CB_DoIdleAnalysis()
+    host.fFactory.SetBuiltins('builtins', [builtins])
+    coord.AddPairsToPrimaryQueue([(B, '*')], priority=2)
+    coord._CB_DoIdleAnalysis()
+    # Queued at priority 0 and scanned in the same slice, before B.
+    assert [s.fKey for s in host.fScanners.Made(PRIMARY_WHOLE)] == [A, builtins, B]
+    finds = len(host.fLog.find('factory', 'FindBuiltinMod'))
+    coord._CB_DoIdleAnalysis()
+    assert len(host.fLog.find('factory', 'FindBuiltinMod')) == finds == 2
+
+
+def test_the_whole_file_check(coord, host):
     fresh, both, nowant, missing, stale = (local('fresh.py'), local('both.py'),
                                            local('lib/nowant.py'), local('gone.py'),
                                            local('stale.py'))
-    info = shost.fInfoCache
+    info = host.fInfoCache
     info.fMTimes[missing] = 0
     info.fScansDone.update({fresh: f'x {PRIMARY} y', both: f'{DERIVED} {PRIMARY}',
                             nowant: PRIMARY, stale: DERIVED})
     info.fImports.update({fresh: [b':ios'], both: [b':fpkg name', b':ios'],
                           nowant: [b':ire']})
-    shost.fLocCache.fAnswers[nowant] = False
-    record_signals(scoord, shost.fLog, 'modtimes-updated')
-    scoord.AddPairsToSecondaryQueue([(fresh, 'f'), (missing, 'g')], priority=1)
-    scoord.AddPairsToPrimaryQueue([(fresh, '*')], priority=1)
-    scoord.AddPairsToPrimaryQueue([(both, '*'), (nowant, 'C.m'), (missing, '*'),
-                                   (stale, '*')], priority=2)
-    shost.fLog.clear()
+    host.fLocCache.fAnswers[nowant] = False
+    record_signals(coord, host.fLog, 'modtimes-updated')
+    coord.AddPairsToSecondaryQueue([(fresh, 'f'), (missing, 'g')], priority=1)
+    coord.AddPairsToPrimaryQueue([(fresh, '*')], priority=1)
+    coord.AddPairsToPrimaryQueue([(both, '*'), (nowant, 'C.m'), (missing, '*'), (stale, '*')],
+                                 priority=2)
+    host.fLog.clear()
 
-    assert scoord._CScanCoordinator__CheckWholeFiles(time.time() + 10) is False
+    assert coord._CScanCoordinator__CheckWholeFiles(time.time() + 10) is False
 
-    assert queued(scoord) == {(fresh, '*', DERIVED): 1, (stale, '*', PRIMARY): 2}
-    assert scoord._fMTimeAtLastWholeFileCheck == {fresh: 100.0, both: 100.0, nowant: 100.0,
-                                                  missing: 0, stale: 100.0}
-    assert list(scoord._fScanQueue._fWholeFilesToCheck.items()) == []
-    [(asked,)] = shost.fLog.args('info_cache', 'GetScansDoneForMultipleFiles')
-    assert asked == {fresh: 100.0, both: 100.0, nowant: 100.0, stale: 100.0}
-    # Derived information is asked about only where the derived scan is not done.
-    wants = [a[0] for a in shost.fLog.args('loc_cache', 'WantDerivedInfo')]
-    assert both not in wants and wants.count(nowant) == 1
+    # Up-to-date files leave the queue, a missing one too; the secondary scan of a
+    # fresh file is queued where its derived scan is not done and wanted.
+    assert queued(coord) == {(fresh, '*', DERIVED): 1, (stale, '*', PRIMARY): 2}
+    assert coord._fMTimeAtLastWholeFileCheck == {fresh: 100.0, both: 100.0, nowant: 100.0,
+                                                 missing: 0, stale: 100.0}
+    assert host.fLog.args('info_cache', 'GetScansDoneForMultipleFiles') == [
+        ({fresh: 100.0, both: 100.0, nowant: 100.0, stale: 100.0},)]
     # The imports of the up-to-date files, per (directory, priority).
-    [(up_to_date,)] = shost.fLog.args('info_cache', 'GetAllImports')
-    assert sorted(up_to_date) == sorted([fresh, both, nowant])
-    priority = {fresh: 1, both: 2, nowant: 2}
-    groups = {}
-    for loc in up_to_date:
-        groups.setdefault((loc.GetParentDir(), priority[loc]), set()).update(info.fImports[loc])
-    # The batch's times, then the (empty) times of each group's module files.
-    assert [c.args for c in shost.fLog.find('signal')] == [
-        (scoord._fMTimeAtLastWholeFileCheck,)] + [({},)] * len(groups)
-    names_of = {b':ios': {'os'}, b':fpkg name': {'pkg.name', 'pkg'}, b':ire': {'re'}}
-    assert shost.fLog.args('factory', '_FindPrimaryLocsForNames') == [
-        (set().union(*(names_of[e] for e in equivs)), dirloc, False)
-        for (dirloc, _prio), equivs in groups.items()]
-    assert scoord.fLog.Texts()[:2] == [
-        checking([(stale, 2), (missing, 2), (nowant, 2), (both, 2), (fresh, 1)]),
-        scans_done({stale: DERIVED, nowant: PRIMARY, both: f'{DERIVED} {PRIMARY}',
-                    fresh: f'x {PRIMARY} y'})]
-    if is_counting(scoord):
-        assert scoord.Called('AddPairsToSecondaryQueue')[-1:] == [([(fresh, '*')], False, 1)]
-        calls = scoord.Called('__AddImportEquivsToQueue')
-        assert [(dirloc, prio) for _e, dirloc, prio in calls] == list(groups)
-        assert [set(e) for e, _d, _p in calls] == list(groups.values())
+    assert sorted((sorted(names), d, flag) for names, d, flag in host.fLog.args(
+        'factory', '_FindPrimaryLocsForNames')) == [
+        (['os'], local(''), False), (['os', 'pkg', 'pkg.name'], local(''), False),
+        (['re'], local('lib'), False)]
+    assert host.fLog.find('signal')[0].args == (coord._fMTimeAtLastWholeFileCheck,)
+    assert coord.fLog.Texts()[0] == checking([(stale, 2), (missing, 2), (nowant, 2), (both, 2),
+                                              (fresh, 1)])
 
 
-def test_missing_modtime_dict_ends_the_slice_through_the_exception_path(shost):
-    class NoTimes(ScanCountingCoordinator):
-        def _CScanCoordinator__GetModtimeDict(self, loc_seq):
-            super()._CScanCoordinator__GetModtimeDict(loc_seq)
-
-    coord = make_coord(NoTimes, shost)
+@pytest.mark.parametrize('answer', [['not', 'a', 'dict'], 42])
+def test_scans_done_of_the_wrong_type_takes_the_exception_path(coord, host, answer):
+    host.fInfoCache.fScansDoneResult = answer
     coord.AddPairsToPrimaryQueue([(A, '*')])
     with pytest.raises((TypeError, AttributeError)) as exc_info:
         coord._CB_DoIdleAnalysis()
-    assert shost.Reports() == [exc_info.value]
-    assert coord.fLog.Messages()[-1] == kExceptionMsg
-    assert coord._fIdleProcId is None
-    assert shost.fLog.find('info_cache', 'GetScansDoneForMultipleFiles') == []
-    assert shost.fScanners.Made() == []
-    coord.destroy()
+    assert host.Reports() == [exc_info.value]
+    assert coord.fLog.Messages()[-2:] == [scans_done(answer), kExceptionMsg]
+    assert coord._fIdleProcId is None and host.fScanners.Made() == []
 
 
-@pytest.mark.parametrize('answer', [None, ['not', 'a', 'dict']])
-def test_scans_done_of_the_wrong_type_ends_the_slice_through_the_exception_path(
-        scoord, shost, answer):
-    shost.fInfoCache.fScansDoneResult = answer
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    with pytest.raises((TypeError, AttributeError)) as exc_info:
-        scoord._CB_DoIdleAnalysis()
-    assert shost.Reports() == [exc_info.value]
-    assert scoord.fLog.Messages()[-2:] == [scans_done(answer), kExceptionMsg]
-    assert scoord._fIdleProcId is None
-    assert shost.fScanners.Made() == []
-
-
-def test_the_check_gives_up_after_a_batch_once_out_of_time(scoord, shost):
-    locs = [local(f'm{i:02}.py') for i in range(30)]
-    scoord.AddPairsToPrimaryQueue([(loc, '*') for loc in locs], priority=2)
+def test_the_check_gives_up_after_a_batch_once_out_of_time(coord, host):
+    coord.AddPairsToPrimaryQueue([(local(f'm{i:02}.py'), '*') for i in range(30)], priority=2)
     end_time = time.time() + 0.01
 
     def wait_for_deadline(loc):
         while time.time() <= end_time:
             time.sleep(0.001)
 
-    shost.fInfoCache.Probe('GetDiskMTime', wait_for_deadline)
-    shost.fLog.clear()
-    assert scoord._CScanCoordinator__DoScans(end_time) is None
-    assert len(shost.fLog.find('info_cache', 'GetDiskMTime')) == 26
-    assert len(scoord._fScanQueue._fWholeFilesToCheck) == 4
-    assert scoord.fLog.Messages()[-1] == kOutOfTimeMsg
-    assert shost.fScanners.Made() == []
+    host.fInfoCache.Probe('GetDiskMTime', wait_for_deadline)
+    coord._CScanCoordinator__DoScans(end_time)
+    assert len(host.fLog.find('info_cache', 'GetDiskMTime')) == 26
+    assert len(coord._fScanQueue._fWholeFilesToCheck) == 4
+    assert coord.fLog.Messages()[-1] == 'Out of time after whole file check'
+    assert host.fScanners.Made() == []
+    host.fLog.clear()
+    coord._CScanCoordinator__DoScans(time.time() - 1.0)  # past its deadline
+    assert [c.what for c in host.fLog] == ['FindBuiltinMod']
 
-
-def test_a_slice_past_its_deadline_does_nothing_but_look_for_basic_modules(scoord, shost):
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    shost.fLog.clear()
-    scoord._CScanCoordinator__DoScans(time.time() - 1.0)
-    assert shost.fLog.names() == [('factory', 'FindBuiltinMod')]
-    assert scoord.fLog.Messages() == []
-    assert queued(scoord) == {(A, '*', PRIMARY): 1}
-
-
-# ---- skipping and dropping scans --------------------------------------------------------
 
 @pytest.mark.parametrize('age, skipped', [(4.9, True), (5.1, False)])
-def test_recently_completed_scans_are_not_run_again(scoord, shost, age, skipped):
-    scoord.AddPairsToPrimaryQueue([(A, 'f')], priority=1)
-    scoord.AddPairsToPrimaryQueue([(B, 'g')], priority=2)
+def test_recently_completed_scans_are_not_run_again(coord, host, age, skipped):
+    coord.AddPairsToPrimaryQueue([(A, 'f')], priority=1)
+    coord.AddPairsToPrimaryQueue([(B, 'g')], priority=2)
     t = time.time() - age
-    scoord._fLastScanCompleted[A] = {('f', PRIMARY): t, ('g', PRIMARY): time.time()}
-
-    result = scoord._CB_DoIdleAnalysis()
-
-    made = [s.fKey for s in shost.fScanners.Made(PRIMARY_SCOPE)]
-    if skipped:
-        # Taken out of the queue, and the slice ends there.
-        assert result is True
-        assert made == []
-        assert queued(scoord) == {(B, 'g', PRIMARY): 2}
-        assert f'Skipping scan because last scan is too recent: {(A, "f", PRIMARY)!r}' in \
-            scoord.fLog.Messages()
-        assert scoord._fLastScanCompleted[A][('f', PRIMARY)] == t
-        assert shost.fLog.find('info_cache', 'FinishedWithScans') == []
+    coord._fLastScanCompleted[A] = {('f', PRIMARY): t, ('g', PRIMARY): time.time()}
+    result = coord._CB_DoIdleAnalysis()
+    made = [s.fKey for s in host.fScanners.Made(PRIMARY_SCOPE)]
+    message = f'Skipping scan because last scan is too recent: {(A, "f", PRIMARY)!r}'
+    if skipped:  # taken out of the queue, and the slice ends there
+        assert (result, made, queued(coord)) == (True, [], {(B, 'g', PRIMARY): 2})
+        assert message in coord.fLog.Messages()
+        assert coord._fLastScanCompleted[A][('f', PRIMARY)] == t
     else:
         assert made == [(A, 'f'), (B, 'g')]
-        assert scoord._fLastScanCompleted[A][('f', PRIMARY)] > t + age - 1
-        assert not any(m.startswith('Skipping') for m in scoord.fLog.Messages())
+        assert coord._fLastScanCompleted[A][('f', PRIMARY)] > t + age - 1
 
 
-@pytest.mark.parametrize('name, is_python, asked', [
-    ('stub.pyi', True, []),
-    ('stub.pi', True, []),
-    ('tool', True, ['IsPythonSource']),
-    ('page.html', True, ['IsPythonSource', 'GetAnalysis']),
-    ('notes.txt', False, ['IsPythonSource', 'GetAnalysis']),
-    ('data.bin', False, ['IsPythonSource', 'GetAnalysis']),
+@pytest.mark.parametrize('name, ana, is_python, asked', [
+    ('stub.pyi', None, True, []),
+    ('tool', None, True, ['IsPythonSource']),
+    ('page.html', 'source', True, ['IsPythonSource', 'GetAnalysis']),
+    ('notes.txt', None, False, ['IsPythonSource', 'GetAnalysis']),
+    ('data.bin', 'other', False, ['IsPythonSource', 'GetAnalysis']),
 ])
-def test_python_check(scoord, shost, monkeypatch, name, is_python, asked):
+def test_the_python_check(coord, host, monkeypatch, name, ana, is_python, asked):
     loc = local(name)
-    if name == 'page.html':
-        shost.fCacheMgr.fAnalyses[loc] = ScanAnalysis(loc, shost.fLog)
-    if name == 'data.bin':
-        shost.fCacheMgr.fAnalyses[loc] = object()  # not a source analysis
+    host.fCacheMgr.fAnalyses[loc] = {None: None, 'other': object(),
+                                     'source': Analysis(loc, host.fLog)}[ana]
 
     def is_python_source(arg):
-        shost.fLog.add('utils', 'IsPythonSource', arg)
+        host.fLog.add('utils', 'IsPythonSource', arg)
         return arg == local('tool')
 
     monkeypatch.setattr(utils, 'IsPythonSource', is_python_source)
-    shost.fLocCache.fAnswers[loc] = False  # no secondary scan to check as well
-    scoord.AddPairsToPrimaryQueue([(loc, 'f')], priority=0)
-    scoord.AddPairsToPrimaryQueue([(B, 'g')], priority=1)
-    shost.fLog.clear()
-
-    assert scoord._CB_DoIdleAnalysis() is False
-    made = [s.fKey for s in shost.fScanners.Made(PRIMARY_SCOPE)]
+    host.fLocCache.fAnswers[loc] = False
+    coord.AddPairsToPrimaryQueue([(loc, 'f')], priority=0)
+    coord.AddPairsToPrimaryQueue([(B, 'g')], priority=1)
+    host.fLog.clear()
+    assert coord._CB_DoIdleAnalysis() is False
+    made = [s.fKey for s in host.fScanners.Made(PRIMARY_SCOPE)]
     assert made == ([(loc, 'f')] if is_python else []) + [(B, 'g')]
     # (The scan itself looks for an existing analysis, without creating one.)
-    assert [c.what for c in shost.fLog if c.args and c.args[0] == loc and (
-        c.what == 'IsPythonSource' or (c.what == 'GetAnalysis' and c.args[1]))] == asked
-    if 'GetAnalysis' in asked:
-        assert shost.fLog.args('cache_mgr', 'GetAnalysis')[0] == (loc, True)
+    assert [c.what for c in host.fLog if c.what in ('IsPythonSource', 'GetAnalysis')
+            and c.args in ((loc,), (loc, True))] == asked
     removed = f'Removing scan because not python: {(loc, "f", PRIMARY)!r}'
-    assert (removed in scoord.fLog.Messages()) is not is_python
-    assert queued(scoord) == {}
-    assert (loc in scoord._fLastScanCompleted) is is_python
-    if is_counting(scoord) and 'GetAnalysis' in asked:
-        assert scoord.Called('__GetAnalysis')[0] == (loc, True)
+    assert (removed in coord.fLog.Messages()) is not is_python
+    assert queued(coord) == {} and (loc in coord._fLastScanCompleted) is is_python
+    monkeypatch.setattr(analysis, 'CPySourceAnalysis', 'not a class')
+    with pytest.raises(TypeError):  # the host's class check fails: the error propagates
+        coord._CScanCoordinator__GetAnalysis(loc, True)
 
 
-def test_location_being_scanned_counts_as_python(scoord, shost, monkeypatch):
-    page = local('page.html')
-    shost.fCacheMgr.fAnalyses[page] = ScanAnalysis(page, shost.fLog)
-    shost.fScanners.Script(PRIMARY_WHOLE, page, [kReadyToScan, kFinishedScanning])
-    shost.fLocCache.fAnswers[page] = False  # no secondary scan of it to check afterwards
-    asked = []
-    monkeypatch.setattr(utils, 'IsPythonSource', lambda loc: asked.append(loc) and False)
-    scoord.AddPairsToPrimaryQueue([(page, '*')], priority=1)
-    assert scoord._CB_DoIdleAnalysis() is True
-    assert scoord._CScanCoordinator__fActiveLoc == page
-    assert asked == [page]
-    # The next slice resumes the same location without asking again.
-    scoord._CB_DoIdleAnalysis()
-    assert asked == [page]
-    assert shost.fLog.args('cache_mgr', 'GetAnalysis') == [(page, True)]
-    assert len(shost.fScanners.One(PRIMARY_WHOLE, page).fScans) == 2
-    assert scoord._CScanCoordinator__fActiveLoc is None
-
-
-def test_get_analysis_answers_only_source_analyses(scoord, shost):
-    ana = ScanAnalysis(A, shost.fLog)
-    shost.fCacheMgr.fAnalyses.update({A: ana, B: 'an analysis of another kind'})
-    get = scoord._CScanCoordinator__GetAnalysis
-    assert get(A, False) is ana
-    assert get(B, True) is None
-    assert get(C, True) is None
-    assert shost.fLog.args('cache_mgr', 'GetAnalysis') == [(A, False), (B, True), (C, True)]
-
-
-def test_secondary_scans_without_builtins_count_as_done(scoord, shost):
-    shost.fLocCache.fBuiltinLoc = None
-    scoord.AddPairsToSecondaryQueue([(A, '*'), (B, 'f')], priority=1)
+def test_secondary_scans_without_builtins_count_as_done(coord, host):
+    host.fLocCache.fBuiltinLoc = None
+    coord.AddPairsToSecondaryQueue([(A, '*'), (B, 'f')], priority=1)
     t0 = time.time()
-    assert scoord._CB_DoIdleAnalysis() is False
-    assert shost.fScanners.Made() == []
-    assert queued(scoord) == {}
-    done = scoord._fLastScanCompleted
-    assert set(done) == {A, B}
-    assert set(done[A]) == {('*', DERIVED)} and set(done[B]) == {('f', DERIVED)}
+    assert coord._CB_DoIdleAnalysis() is False
+    assert host.fScanners.Made() == [] and queued(coord) == {}
+    done = coord._fLastScanCompleted
+    assert (set(done[A]), set(done[B])) == ({('*', DERIVED)}, {('f', DERIVED)})
     assert t0 <= done[A][('*', DERIVED)] <= done[B][('f', DERIVED)] <= time.time()
-    assert scoord._CScanCoordinator__fCompletedLocs == {A, B}
-    assert len(shost.fLog.find('info_cache', 'Trim')) == 2
-    # Nothing ran, so nothing is reported finished or counted.
-    assert shost.fLog.find('info_cache', 'FinishedWithScans') == []
-    assert dict(scoord._fScanTripleCompletedCount) == {}
-    if is_counting(scoord):
-        assert len(scoord.Called('_DoSingleScan')) == 2
-        assert scoord.Called('__DoSecondaryWholeFileScan') == []
-        assert scoord.Called('__DoSecondarySingleScopeScan') == []
+    assert coord._CScanCoordinator__fCompletedLocs == {A, B}
+    assert len(host.fLog.find('info_cache', 'Trim')) == 2
+    assert host.fLog.find('info_cache', 'FinishedWithScans') == []
+    assert dict(coord._fScanTripleCompletedCount) == {}
 
 
-# ---- one scan ----------------------------------------------------------------------------
-
-def test_do_single_scan_dispatch_and_bookkeeping(scoord, shost):
+def test_do_single_scan_bookkeeping(coord, host):
     seen = []
 
     def probe(scanner, end_time):
-        seen.append(scoord.fActiveScanItem)
+        seen.append(coord.fActiveScanItem)
         return kFinishedScanning
 
-    items = [CScanItem(A, '*', PRIMARY, 1), CScanItem(A, 'f', PRIMARY, 1),
-             CScanItem(B, '*', DERIVED, 2), CScanItem(B, 'g', DERIVED, 2),
-             CScanItem(C, '*', 'other-scan', 0)]
-    for kind, key in [(PRIMARY_WHOLE, A), (PRIMARY_SCOPE, (A, 'f')), (SECONDARY_WHOLE, B),
-                      (SECONDARY_SCOPE, (B, 'g')), (SECONDARY_WHOLE, C)]:
-        shost.fScanners.Script(kind, key, [probe])
-    end_time = time.time() + 5
-    for item in items:
-        assert scoord._DoSingleScan(item, end_time) is False
-        assert scoord.fActiveScanItem is None
-    assert seen == items
-    assert [(s.kKind, s.fKey) for s in shost.fScanners.Made()] == [
-        (PRIMARY_WHOLE, A), (PRIMARY_SCOPE, (A, 'f')), (SECONDARY_WHOLE, B),
-        (SECONDARY_SCOPE, (B, 'g')), (SECONDARY_WHOLE, C)]
-    assert shost.fScanners.Made()[-1].fArgs == (C, 'other-scan', scoord.fLog)
-    assert all(s.fScans[0].end_time == end_time for s in shost.fScanners.Made())
-    assert shost.fLog.args('info_cache', 'FinishedWithScans') == [tuple(i[:3]) for i in items]
-    assert dict(scoord._fScanTripleCompletedCount) == {tuple(i[:3]): 1 for i in items}
-    assert scoord._DoSingleScan(items[0], end_time) is False
-    assert scoord._fScanTripleCompletedCount[(A, '*', PRIMARY)] == 2
-
-
-def test_do_single_scan_unfinished_or_failing(scoord, shost):
-    item = CScanItem(A, 'f', PRIMARY, 1)
-    shost.fScanners.Script(PRIMARY_SCOPE, (A, 'f'), [kReadyToScan, Boom('bad'),
-                                                      kFinishedScanning])
-    end_time = time.time() + 5
-    assert scoord._DoSingleScan(item, end_time) is True
-    assert scoord.fActiveScanItem is None
+    items = [CScanItem(A, 'f', PRIMARY, 1), CScanItem(C, '*', 'other-scan', 0)]
+    host.fScanners.Script(PRIMARY_SCOPE, (A, 'f'), [probe])
+    host.fScanners.Script(SECONDARY_WHOLE, C, [probe])  # any other name is a secondary scan
+    end_time = end_in()
+    for item in items + items[:1]:
+        assert coord._DoSingleScan(item, end_time) is False and coord.fActiveScanItem is None
+    assert seen == items + items[:1]
+    assert host.fLog.args('info_cache', 'FinishedWithScans') == [
+        (A, 'f', PRIMARY), (C, '*', 'other-scan'), (A, 'f', PRIMARY)]
+    assert dict(coord._fScanTripleCompletedCount) == {(A, 'f', PRIMARY): 2,
+                                                       (C, '*', 'other-scan'): 1}
+    host.fScanners.Script(PRIMARY_SCOPE, (B, 'f'), [kReadyToScan, Boom('bad')])
+    item = CScanItem(B, 'f', PRIMARY, 1)
+    assert coord._DoSingleScan(item, end_time) is True
     with pytest.raises(Boom):
-        scoord._DoSingleScan(item, end_time)
-    assert scoord.fActiveScanItem is None
-    assert shost.fLog.find('info_cache', 'FinishedWithScans') == []
-    assert dict(scoord._fScanTripleCompletedCount) == {}
-    assert scoord._DoSingleScan(item, end_time) is False
-    assert len(shost.fScanners.Made()) == 1
+        coord._DoSingleScan(item, end_time)
+    assert coord.fActiveScanItem is None and (B, 'f', PRIMARY) not in \
+        coord._fScanTripleCompletedCount
 
 
-# ---- failures and recovery -----------------------------------------------------------------
-
-def test_a_failing_scanner_is_reported_reraised_and_resumed(scoord, shost):
-    shost.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, Boom('scan failed'),
-                                              kFinishedScanning])
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    take_over_idle(scoord)
-    assert scoord._CB_DoIdleAnalysis() is True
-    with pytest.raises(Boom) as exc_info:
-        scoord._CB_DoIdleAnalysis()
-    assert shost.Reports() == [exc_info.value]
-    assert scoord.fLog.Messages()[-2:] == [kEntering, kExceptionMsg]
-    assert scoord._fIdleProcId is None
-    assert scoord.fActiveScanItem is None
-    scanner = shost.fScanners.One(PRIMARY_WHOLE, A)
-    assert active(scoord, PRIMARY_WHOLE) == {A: scanner}
-    assert queued(scoord) == {(A, '*', PRIMARY): 1}
-
-    scoord._ScheduleIdle()
-    assert len(analysis_idles(scoord)) == 1
-    assert ostrelgtk.run_until_idle(100)
-    assert shost.fScanners.Made(PRIMARY_WHOLE) == [scanner]
-    assert len(scanner.fScans) == 3
-    assert scoord.fLog.Messages().count(f'Starting primary whole file scan: {A!r}') == 1
-    assert scoord.QueuesEmpty()
-    assert len(shost.fScanners.Made(SECONDARY_WHOLE, A)) == 1
-
-
-def test_a_failing_collaborator_leaves_the_work_queued(scoord, shost):
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    take_over_idle(scoord)
-    shost.fInfoCache.Fail('GetDiskMTime', Boom('disk gone'))
-    with pytest.raises(Boom):
-        scoord._CB_DoIdleAnalysis()
-    assert queued(scoord) == {(A, '*', PRIMARY): 1}
-    assert scoord._fIdleProcId is None
-
-    shost.fInfoCache.Fail('GetDiskMTime', None)
-    scoord._ScheduleIdle()
-    assert ostrelgtk.run_until_idle(100)
-    assert scoord.QueuesEmpty()
-    assert [s.fKey for s in shost.fScanners.Made()] == [A, A]
-
-
-def test_the_main_loop_sees_the_reraised_exception(scoord, shost):
-    shost.fScanners.Script(PRIMARY_WHOLE, A, [Boom('scan failed'), kFinishedScanning])
-    record_signals(scoord, shost.fLog, 'scheduled')
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    sid = scoord._fIdleProcId
-    assert ostrelgtk.iteration()
-    # Reported by the coordinator, then by the main loop that got it re-raised.
-    reports = shost.Reports()
-    assert len(reports) == 2 and reports[0] is reports[1]
-    assert isinstance(reports[0], Boom)
-    assert not ostrelgtk.GetMainLoop().has_source(sid)
-    assert scoord._fIdleProcId is None
-    # The queue's "locations-added" asks for the idle again, which finishes the scan.
-    assert ostrelgtk.run_until_idle(100)
-    assert [c.what for c in shost.fLog.find('signal')] == ['scheduled', 'scheduled']
-    assert scoord.QueuesEmpty() and len(shost.Reports()) == 2
-
-
-# ---- logging and the run of slices ----------------------------------------------------------
-
-def test_queue_listing_only_when_logging_is_on(scoord, shost):
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    scoord._CB_DoIdleAnalysis()
-    texts = scoord.fLog.Texts()
-    assert texts.index(kEmptyMsg) < texts.index('_CScanQueue contents:\n')
-
-    scoord.fLog.Clear()
-    scoord.fLog.fOutputFile = None
-    scoord.AddPairsToPrimaryQueue([(B, '*')])
-    scoord._CB_DoIdleAnalysis()
-    assert scoord.fLog.DumpLines() == []
-    assert scoord.fLog.Texts()[-1] == kEmptyMsg
-
-
-def test_start_of_a_run_of_slices(scoord, shost):
-    shost.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, kReadyToScan, kFinishedScanning])
-    assert scoord._fActiveIdleStart == -1.0 and scoord._fLastLogQueue == -1.0
-    scoord.AddPairsToPrimaryQueue([(A, '*')])
-    _result, t0, t1 = timed_slice(scoord)
-    start = scoord._fActiveIdleStart
-    assert t0 <= start <= t1
-    assert scoord._fLastLogQueue == start
-    scoord._CB_DoIdleAnalysis()
-    assert scoord._fActiveIdleStart == start and scoord._fLastLogQueue == start
-    assert scoord.fLog.DumpLines() == []  # no listing within two seconds
-    scoord._CB_DoIdleAnalysis()
-    assert scoord._fActiveIdleStart == -1.0
-    assert scoord._fLastLogQueue == start
-
-
-# ---- overrides -------------------------------------------------------------------------
-
-def test_overridden_single_scan_decides_for_the_loop(shost):
-    class Holding(ScanCountingCoordinator):
-        def _DoSingleScan(self, scan_item, end_time):
-            self.fCalls.append(('_DoSingleScan', scan_item, end_time))
-            return True
-
-    coord = make_coord(Holding, shost)
+def test_a_failing_scanner_is_reported_reraised_and_resumed(coord, host):
+    host.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan, Boom('scan failed'),
+                                             kFinishedScanning])
+    record_signals(coord, host.fLog, 'scheduled')
     coord.AddPairsToPrimaryQueue([(A, '*')])
-    assert coord._CB_DoIdleAnalysis() is True
-    assert [c[0] for c in coord.Called('_DoSingleScan')] == [CScanItem(A, '*', PRIMARY, 1)]
-    assert shost.fScanners.Made() == []
+    sid = coord._fIdleProcId
+    assert ostrelgtk.iteration() and ostrelgtk.iteration()
+    # Reported by the coordinator, then by the main loop that got it re-raised.
+    [first, second] = host.Reports()
+    assert first is second and isinstance(first, Boom)
+    assert coord.fLog.Messages()[-1] == kExceptionMsg
+    assert not ostrelgtk.GetMainLoop().has_source(sid) and coord._fIdleProcId is None
+    scanner = host.fScanners.One()
+    assert active(coord, PRIMARY_WHOLE) == {A: scanner} and coord.fActiveScanItem is None
     assert queued(coord) == {(A, '*', PRIMARY): 1}
-    assert coord._fLastScanCompleted == {}
-    coord.destroy()
+    coord._ScheduleIdle()
+    assert ostrelgtk.run_until_idle(100)
+    assert host.fScanners.Made(PRIMARY_WHOLE) == [scanner] and len(scanner.fScans) == 3
+    assert coord.QueuesEmpty() and len(host.Reports()) == 2
+
+
+def test_the_queue_listing_and_the_run_of_slices(coord, host):
+    host.fScanners.Script(PRIMARY_WHOLE, A, [kReadyToScan] * 3 + [kFinishedScanning])
+    coord.AddPairsToPrimaryQueue([(A, '*')])
+    t0 = time.time()
+    coord._CB_DoIdleAnalysis()
+    start = coord._fActiveIdleStart
+    assert t0 <= start <= time.time() and coord._fLastLogQueue == start
+    coord._CB_DoIdleAnalysis()
+    assert (coord._fActiveIdleStart, coord._fLastLogQueue) == (start, start)
+    assert coord.fLog.Messages() == coord.fLog.Texts()  # no listing within two seconds
+    time.sleep(2.01)
+    n = len(coord.fLog.fCalls)
+    coord._CB_DoIdleAnalysis()  # the queue is listed every two seconds of a run of slices
+    assert coord.fLog.Texts()[n:n + 2] == [kEntering, '_CScanQueue contents:\n']
+    assert coord._fLastLogQueue > start + 2 and coord._fActiveIdleStart == start
+    coord._CB_DoIdleAnalysis()
+    assert coord._fActiveIdleStart == -1.0
+    texts = coord.fLog.Texts()
+    assert texts[texts.index(kEmptyMsg) + 1] == '_CScanQueue contents:\n'
+    coord.fLog.fCalls.clear()
+    coord.fLog.fOutputFile = None  # logging off: no listing
+    coord.AddPairsToPrimaryQueue([(B, '*')])
+    coord._CB_DoIdleAnalysis()
+    assert coord.fLog.Texts()[-1] == kEmptyMsg and coord.fLog.Messages() == coord.fLog.Texts()

@@ -13,115 +13,59 @@ import pytest
 
 import pysource.scancoordinator as sc
 
-MODULE_NAMES = ['bisect', 'collections', 'itertools', 'sys', 'time',
-                'textcache', 'ostrelgtk', 'logicalline', 'destroyable', 'location', 'mime',
-                'callutils', 'reflect', 'config', 'singleton',
-                'analysis', 'inferenceengine', 'inferencer', 'prefs', 'scopescanner',
-                'scopeinfo', 'symbolinfo', 'usageordereddict', 'utils', '_fastaccess',
-                'strutils']
+MODULE_NAMES = ['bisect', 'collections', 'itertools', 'sys', 'time', 'textcache', 'ostrelgtk',
+                'logicalline', 'destroyable', 'location', 'mime', 'callutils', 'reflect', 'config',
+                'singleton', 'analysis', 'inferenceengine', 'inferencer', 'prefs', 'scopescanner',
+                'scopeinfo', 'symbolinfo', 'usageordereddict', 'utils', '_fastaccess', 'strutils']
 
 
-def test_collaborator_modules_are_bound_under_their_names():
-    import config
+def test_collaborator_modules_are_bound_in_body_order():
     import singleton
-    from guiutils import ostrelgtk
 
-    from pysource import _fastaccess, symbolinfo
-    for name in MODULE_NAMES:
-        assert isinstance(getattr(sc, name), types.ModuleType), name
-    assert sc.ostrelgtk is ostrelgtk
-    assert sc.config is config and sc.singleton is singleton
-    assert sc.symbolinfo is symbolinfo and sc._fastaccess is _fastaccess
-
-
-def test_names_are_bound_in_body_order():
+    from pysource import _fastaccess
+    assert all(isinstance(getattr(sc, name), types.ModuleType) for name in MODULE_NAMES)
+    assert sc.singleton is singleton and sc._fastaccess is _fastaccess
     names = list(vars(sc))
     order = [*MODULE_NAMES, 'CScanItem', 'kTypingModulePriority', '_CSingleScanQueue',
              '_CScanQueue', 'CSingleQueueStatus', 'CScanStatus', 'CScanCoordinator']
-    positions = [names.index(n) for n in order]
-    assert positions == sorted(positions)
+    assert [names.index(n) for n in order] == sorted(names.index(n) for n in order)
 
 
-def test_priorities_are_published_ints_in_ascending_urgency():
-    assert (sc.kTypingModulePriority, sc.kInteractivePriority, sc.kBackgroundPriority) == (0, 1, 2)
-    assert all(type(p) is int for p in (sc.kTypingModulePriority, sc.kInteractivePriority,
-                                        sc.kBackgroundPriority))
-
-
-def test_internal_constants_are_not_published():
-    assert not hasattr(sc, 'kMaxWholeFilesPerCheck')
-    assert not hasattr(sc, 'kMinRescanInterval')
-
-
-class TestRecords:
-    def test_scan_item_fields_and_empty_item(self):
-        assert sc.CScanItem._fields == ('loc', 'scope_name', 'scan_name', 'priority')
-        loc, scope, name, prio = sc.CScanItem(None, None, None, None)
-        assert (loc, scope, name, prio) == (None, None, None, None)
-        item = sc.CScanItem('L', '*', 'primary', 2)
-        assert item[:3] == ('L', '*', 'primary')
-        assert item == ('L', '*', 'primary', 2) and hash(item) == hash(('L', '*', 'primary', 2))
-
-    def test_status_records(self):
-        assert sc.CSingleQueueStatus._fields == ('scan_name', 'priority', 'file_count')
-        assert sc.CScanStatus._fields == ('queue_status_list', 'waiting_count')
-        for rec in (sc.CScanItem, sc.CSingleQueueStatus, sc.CScanStatus):
-            assert rec.__module__ == 'pysource.scancoordinator'
-            assert issubclass(rec, tuple)
-
-    def test_items_handed_out_by_the_queue_are_scan_items(self, tmp_path):
-        from ostrelbase import destroyable
-
-        class Cache(destroyable.CDestroyable):
-            def __init__(self):
-                super().__init__(('now-tree-branch-ready', 'inspect-failed', 'cleared'))
-
-        q = sc._CScanQueue(Cache())
-        q.SetScansToOrder({'s': 0})
-        assert type(q.First()) is sc.CScanItem
-        q.AddScanPairs([('L', 'a')], 's')
-        item = q.First()
-        assert type(item) is sc.CScanItem and item.priority == 2
-        q.destroy()
-
-
-class TestClasses:
-    @pytest.mark.parametrize('name', ['_CSingleScanQueue', '_CScanQueue', 'CScanCoordinator'])
-    def test_heap_types_derived_from_the_host_base(self, name):
-        from ostrelbase.destroyable import CDestroyable
-        cls = getattr(sc, name)
-        assert issubclass(cls, CDestroyable)
-        assert cls.__module__ == 'pysource.scancoordinator'
-        assert cls.__flags__ & (1 << 9), 'heap type'
-        assert cls.__flags__ & (1 << 10), 'subclassable'
+def test_constants_records_and_classes():
+    priorities = (sc.kTypingModulePriority, sc.kInteractivePriority, sc.kBackgroundPriority)
+    assert priorities == (0, 1, 2) and all(type(p) is int for p in priorities)
+    assert not hasattr(sc, 'kMaxWholeFilesPerCheck') and not hasattr(sc, 'kMinRescanInterval')
+    for rec, fields in [(sc.CScanItem, ('loc', 'scope_name', 'scan_name', 'priority')),
+                        (sc.CSingleQueueStatus, ('scan_name', 'priority', 'file_count')),
+                        (sc.CScanStatus, ('queue_status_list', 'waiting_count'))]:
+        assert rec._fields == fields and issubclass(rec, tuple)
+        assert rec.__module__ == 'pysource.scancoordinator'
+    from ostrelbase.destroyable import CDestroyable
+    for cls in (sc._CSingleScanQueue, sc._CScanQueue, sc.CScanCoordinator):
+        assert issubclass(cls, CDestroyable) and cls.__module__ == 'pysource.scancoordinator'
+        assert cls.__flags__ & (1 << 9) and cls.__flags__ & (1 << 10), 'subclassable heap type'
         assert cls.__weakrefoffset__ != 0
-
-    def test_coordinator_docstring(self):
-        assert sc.CScanCoordinator.__doc__ == 'Class to coordinate scanning of files'
+    assert sc.CScanCoordinator.__doc__ == 'Class to coordinate scanning of files'
 
 
-class TestTime:
-    def test_now_time_is_wall_clock(self):
-        before = time.time()
-        now = sc.GetNowTime()
-        after = time.time()
-        assert before - 0.01 <= now <= after + 0.01
-
-    def test_out_of_time(self):
-        assert sc.OutOfTime(sc.GetNowTime() - 1.0) is True
-        assert sc.OutOfTime(sc.GetNowTime() + 60.0) is False
-        with pytest.raises(TypeError):
-            sc.OutOfTime('soon')
+def test_time_helpers():
+    before = time.time()
+    assert before - 0.01 <= sc.GetNowTime() <= time.time() + 0.01
+    assert sc.OutOfTime(sc.GetNowTime() - 1.0) is True
+    assert sc.OutOfTime(sc.GetNowTime() + 60.0) is False
+    with pytest.raises(TypeError):
+        sc.OutOfTime('soon')
 
 
 class TestInitialisation:
     def test_importing_again_returns_the_same_module(self):
         mod = sys.modules.pop('pysource.scancoordinator')
         try:
-            again = importlib.import_module('pysource.scancoordinator')
-            assert again is mod
+            assert importlib.import_module('pysource.scancoordinator') is mod
         finally:
             sys.modules['pysource.scancoordinator'] = mod
+        spec = importlib.util.find_spec('pysource.scancoordinator')
+        assert spec.loader.create_module(spec) is sc
 
     def test_executing_the_body_for_another_module_object_raises(self):
         lib = ctypes.PyDLL(sc.__file__)
@@ -136,6 +80,14 @@ class TestInitialisation:
                                   "Re-initialisation is not supported.")
         # The loaded module is untouched.
         assert sc._CScanQueue.__name__ == '_CScanQueue'
+
+    def test_without_a_package_the_engines_modules_are_bound(self):
+        code = 'import sys; sys.path.insert(0, sys.argv[1]); import scancoordinator as m; ' \
+               'print(m.analysis.__name__)'
+        env = dict(os.environ, PYTHONPATH=os.pathsep.join(p for p in sys.path if p))
+        out = subprocess.run([sys.executable, '-c', code, os.path.dirname(sc.__file__)],
+                             capture_output=True, text=True, timeout=120, env=env, check=False)
+        assert out.stdout == 'pysource.analysis\n', out.stderr
 
     def test_second_interpreter_gets_import_error(self):
         code = textwrap.dedent('''
@@ -157,8 +109,3 @@ class TestInitialisation:
         assert out.returncode == 0, out.stderr
         assert ('ImportError: Interpreter change detected - this module can only be loaded '
                 'into one interpreter per process.') in out.stdout
-
-    def test_spec_loader_round_trip_returns_the_loaded_module(self):
-        spec = importlib.util.find_spec('pysource.scancoordinator')
-        created = spec.loader.create_module(spec)
-        assert created is sc

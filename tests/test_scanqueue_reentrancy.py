@@ -36,17 +36,11 @@ class _ReentrantLoc:
         if q is not None and self.rng.random() < 0.05:
             _ReentrantLoc.queue = None  # one level of re-entry at a time
             try:
-                op = self.rng.randrange(5)
-                if op == 0:
-                    q.RemoveAllForLocations([self.rng.choice(self.locs)])
-                elif op == 1:
-                    q.AddScanPairs([(self.rng.choice(self.locs), self.rng.choice('ab*'))], 'p')
-                elif op == 2:
-                    q.First()
-                elif op == 3:
-                    q.Clear()
-                else:
-                    q.UpdateForVisibleDocuments(self.locs[0], self.locs[1:3])
+                self.rng.choice([
+                    lambda: q.RemoveAllForLocations([self.rng.choice(self.locs)]),
+                    lambda: q.AddScanPairs([(self.rng.choice(self.locs), 'a')], 'p'),
+                    q.First, q.Clear,
+                    lambda: q.UpdateForVisibleDocuments(self.locs[0], self.locs[1:3])])()
             except TOLERATED:
                 pass
             finally:
@@ -58,6 +52,18 @@ class _ReentrantLoc:
 
     def __repr__(self):
         return f'E{self.n}'
+
+
+def random_operation(q, rng, locs):
+    rng.choice([
+        lambda: q.AddScanPairs([(rng.choice(locs), rng.choice('abc*')) for _ in range(3)],
+                               rng.choice('pd'), rng.randrange(4), rng.random() < 0.5),
+        lambda: q.RemoveScanTriple((rng.choice(locs), rng.choice('abc*'), 'p')),
+        lambda: q.First().loc is not None and q.ScanCompleted(q.First()),
+        lambda: q.RemoveAllForLocations(rng.sample(locs, 3)),
+        lambda: q._fLocationDataCache.emit('now-tree-branch-ready', None,
+                                           set(rng.sample(locs, 4))),
+        lambda: ostrelgtk.run_until_idle(100)])()
 
 
 @pytest.mark.parametrize('seed', range(4))
@@ -72,24 +78,8 @@ def test_reentrant_hashing_never_breaks_the_queue(monkeypatch, seed):
         _ReentrantLoc.queue = q
         try:
             for _ in range(40):
-                op = rng.randrange(6)
                 try:
-                    if op == 0:
-                        q.AddScanPairs([(rng.choice(locs), rng.choice('abc*')) for _ in range(3)],
-                                       rng.choice('pd'), rng.randrange(4), rng.random() < 0.5)
-                    elif op == 1:
-                        q.RemoveScanTriple((rng.choice(locs), rng.choice('abc*'), 'p'))
-                    elif op == 2:
-                        item = q.First()
-                        if item.loc is not None:
-                            q.ScanCompleted(item)
-                    elif op == 3:
-                        q.RemoveAllForLocations(rng.sample(locs, 3))
-                    elif op == 4:
-                        q._fLocationDataCache.emit('now-tree-branch-ready', None,
-                                                   set(rng.sample(locs, 4)))
-                    else:
-                        ostrelgtk.run_until_idle(100)
+                    random_operation(q, rng, locs)
                 except TOLERATED:
                     pass
         finally:

@@ -1,1 +1,0 @@
-"""Pure-Python models of compiled classes, used by the tests and the benchmarks."""

@@ -241,6 +241,15 @@ def MakeProgress(console: Console, plain: bool, quiet: bool) -> Any:
 # -- summary -------------------------------------------------------------------------
 
 
+def _AddNamedRows(table: Table, label: str, figure: str, names: list[str], style: str) -> None:
+    """A row with a count, then the first few of what it counts, one per row."""
+    table.add_row(label, figure)
+    for name in names[:kFirstFew]:
+        table.add_row('', Text(name, style=style))
+    if len(names) > kFirstFew:
+        table.add_row('', f'... and {len(names) - kFirstFew:,} more')
+
+
 def PrintSummary(console: Console, s: dict[str, Any]) -> None:
     """The summary table (see ``CollectSummary`` for the figures)."""
     files = s['files']
@@ -255,26 +264,17 @@ def PrintSummary(console: Console, s: dict[str, Any]) -> None:
         table.add_row('not reached', f"{files['not_reached']:,}")
     failed = s['failed']
     kinds = collections.Counter(f['kind'] for f in failed)
-    table.add_row('failed', f'{len(failed):,}' + (
-        ' (' + ', '.join(f'{k} {n:,}' for k, n in sorted(kinds.items())) + ')' if failed else ''))
-    for f in failed[:kFirstFew]:
-        table.add_row('', Text(f"{f['path']}: {f['kind']} ({f['detail']})", style='red'))
-    if len(failed) > kFirstFew:
-        table.add_row('', f'... and {len(failed) - kFirstFew:,} more')
+    _AddNamedRows(table, 'failed', f'{len(failed):,}' + (
+        ' (' + ', '.join(f'{k} {n:,}' for k, n in sorted(kinds.items())) + ')' if failed else ''),
+        [f"{f['path']}: {f['kind']} ({f['detail']})" for f in failed], 'red')
     errors = s['syntax_errors']
     if errors:
-        table.add_row('with syntax errors', f'{len(errors):,} (scanned; scopes marked incomplete)')
-        for path in errors[:kFirstFew]:
-            table.add_row('', Text(path, style='yellow'))
-        if len(errors) > kFirstFew:
-            table.add_row('', f'... and {len(errors) - kFirstFew:,} more')
+        _AddNamedRows(table, 'with syntax errors',
+                      f'{len(errors):,} (scanned; scopes marked incomplete)', errors, 'yellow')
     skipped = s['skipped_entries']
     if skipped:
-        table.add_row('not followed', f'{len(skipped):,} links or special files')
-        for e in skipped[:kFirstFew]:
-            table.add_row('', Text(f"{e['path']}: {e['reason']}", style='yellow'))
-        if len(skipped) > kFirstFew:
-            table.add_row('', f'... and {len(skipped) - kFirstFew:,} more')
+        _AddNamedRows(table, 'not followed', f'{len(skipped):,} links or special files',
+                      [f"{e['path']}: {e['reason']}" for e in skipped], 'yellow')
     imp = s['imported_modules']
     table.add_row('imported modules followed',
                   f"{imp['followed']:,} outside the project ({imp['scanned']:,} scanned, "

@@ -761,7 +761,8 @@ bool RemoveScanTriple(Q *q, Borrowed loc, Borrowed scope, Borrowed scan_name, Bo
   Ref sq_obj = call::GetSingleQueue(q, scan_name, as_int64(prio));
   SingleQueueObject *sq = as_single_queue(sq_obj.get());
   Ref uod = sq->f.fOrderedDict;
-  Ref name_list = om::get(uod, loc);
+  // A completed scan is usually of the location at the front of its queue.
+  Ref name_list = om::get_likely_first(uod, loc);
   if (!name_list)
     return false;
   PyListObject *l = as_name_list(name_list);

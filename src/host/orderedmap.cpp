@@ -63,6 +63,19 @@ py::Ref get(py::Borrowed d, py::Borrowed key) {
   return absent_to_empty(py::call_method(d, names().get, key));
 }
 
+py::Ref get_likely_first(py::Borrowed d, py::Borrowed key) {
+  if (exact(d)) {
+    // The first entry holding the very key object is the entry a lookup would
+    // find: keys are unique, and a lookup tries identity first.
+    PyObject *k = nullptr, *v = nullptr;
+    if (g_api->first(d.get(), &k, &v) < 0)
+      py::throw_error();
+    if (k == key.get())
+      return py::Ref::borrow(v);
+  }
+  return get(d, key);
+}
+
 void set(py::Borrowed d, py::Borrowed key, py::Borrowed value, bool first) {
   if (exact(d)) {
     if (g_api->set(d.get(), key.get(), value.get(), first ? 1 : 0) < 0)

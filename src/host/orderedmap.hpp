@@ -21,6 +21,9 @@ py::Ref create();
 py::Ref get(py::Borrowed d, py::Borrowed key, bool first);
 // d.get(key); empty Ref when absent
 py::Ref get(py::Borrowed d, py::Borrowed key);
+// get(d, key), for a key that is often the first entry's own key object: then
+// the first entry's value, without hashing or comparing the key.
+py::Ref get_likely_first(py::Borrowed d, py::Borrowed key);
 // d.Set(key, value, first=first)
 void set(py::Borrowed d, py::Borrowed key, py::Borrowed value, bool first);
 // d.pop(key, None); empty Ref when absent

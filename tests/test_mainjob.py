@@ -233,7 +233,10 @@ def many_files(root, count):
 @pytest.mark.parametrize('signum', [signal.SIGINT, signal.SIGTERM])
 def test_a_signal_stops_the_scan_cleanly_and_the_next_run_goes_on(tmp_path, signum):
     root, db, out = tmp_path / 'proj', tmp_path / 'db.sqlite', tmp_path / 'first.json'
-    many_files(root, 250)
+    # Primary scans of a few hundred of these files take about a second here:
+    # enough that the first progress line comes well before the last one.
+    count = 1000
+    many_files(root, count)
     proc = subprocess.Popen([*SCAN, str(root), '--db', str(db), '--no-follow-stdlib', '--plain',
                              '--json', str(out)], env=ENV, stdout=subprocess.PIPE,
                             stderr=subprocess.PIPE, text=True)
@@ -258,12 +261,12 @@ def test_a_signal_stops_the_scan_cleanly_and_the_next_run_goes_on(tmp_path, sign
         assert conn.execute('PRAGMA integrity_check').fetchone() == ('ok',)
         urls = [bytes(u) for (u,) in conn.execute('SELECT url FROM files')]
     stored = sum(1 for u in urls if u.startswith(prefix))
-    assert 0 < stored < 250 and first['files']['not_reached'] == 250 - stored
+    assert 0 < stored < count and first['files']['not_reached'] == count - stored
 
     status, second, _out, err = run_scan(root, db)
     assert status == 0, err
     assert second['files']['up_to_date'] == stored
-    assert second['files']['scanned'] == second['scans']['primary_whole_file'] == 250 - stored
+    assert second['files']['scanned'] == second['scans']['primary_whole_file'] == count - stored
 
 
 # -- bad input ---------------------------------------------------------------------------

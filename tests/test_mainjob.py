@@ -230,43 +230,50 @@ def many_files(root, count):
         (root / f'm{i:03d}.py').write_text(f'import os\nfrom m000 import C0\n\n\n{body}')
 
 
-@pytest.mark.parametrize('signum', [signal.SIGINT, signal.SIGTERM])
-def test_a_signal_stops_the_scan_cleanly_and_the_next_run_goes_on(tmp_path, signum):
-    root, db, out = tmp_path / 'proj', tmp_path / 'db.sqlite', tmp_path / 'first.json'
+def test_a_signal_stops_the_scan_cleanly_and_the_next_run_goes_on(tmp_path):
+    """SIGINT stops the first run, SIGTERM the second (which resumes the first);
+    a third run finishes what is left."""
+    root, db = tmp_path / 'proj', tmp_path / 'db.sqlite'
     # Primary scans of a few hundred of these files take about a second here:
     # enough that the first progress line comes well before the last one.
     count = 1000
     many_files(root, count)
-    proc = subprocess.Popen([*SCAN, str(root), '--db', str(db), '--no-follow-stdlib', '--plain',
-                             '--json', str(out)], env=ENV, stdout=subprocess.PIPE,
-                            stderr=subprocess.PIPE, text=True)
-    try:
-        # Progress lines come once a second: stop it once some files are done.
-        for line in proc.stdout:
-            found = re.search(r'primary (\d+) done', line)
-            if found and int(found.group(1)) > 5:
-                break
-        else:
-            raise AssertionError(proc.stderr.read())
-        proc.send_signal(signum)
-        stdout, stderr = proc.communicate(timeout=60)
-    finally:
-        proc.kill()
-    assert proc.returncode == 128 + signum, stderr
-    assert 'Traceback' not in stdout + stderr and 'Interrupted' in stdout
-    first = read_json(out)
-    assert first['outcome'] == 'interrupted'
     prefix = f'file://{root}/'.encode()
-    with sqlite3.connect(db) as conn:
-        assert conn.execute('PRAGMA integrity_check').fetchone() == ('ok',)
-        urls = [bytes(u) for (u,) in conn.execute('SELECT url FROM files')]
-    stored = sum(1 for u in urls if u.startswith(prefix))
-    assert 0 < stored < count and first['files']['not_reached'] == count - stored
+    stored_before = 0
+    for run, signum in enumerate((signal.SIGINT, signal.SIGTERM)):
+        out = tmp_path / f'run{run}.json'
+        proc = subprocess.Popen([*SCAN, str(root), '--db', str(db), '--no-follow-stdlib',
+                                 '--plain', '--json', str(out)], env=ENV,
+                                stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True)
+        try:
+            # Progress lines come once a second: stop it once some files are done.
+            for line in proc.stdout:
+                found = re.search(r'primary (\d+) done', line)
+                if found and int(found.group(1)) > 5:
+                    break
+            else:
+                raise AssertionError(proc.stderr.read())
+            proc.send_signal(signum)
+            stdout, stderr = proc.communicate(timeout=60)
+        finally:
+            proc.kill()
+        assert proc.returncode == 128 + signum, stderr
+        assert 'Traceback' not in stdout + stderr and 'Interrupted' in stdout
+        summary = read_json(out)
+        assert summary['outcome'] == 'interrupted'
+        with sqlite3.connect(db) as conn:
+            assert conn.execute('PRAGMA integrity_check').fetchone() == ('ok',)
+            urls = [bytes(u) for (u,) in conn.execute('SELECT url FROM files')]
+        stored = sum(1 for u in urls if u.startswith(prefix))
+        assert stored_before < stored < count
+        assert summary['files']['up_to_date'] == stored_before
+        assert summary['files']['not_reached'] == count - stored
+        stored_before = stored
 
-    status, second, _out, err = run_scan(root, db)
+    status, last, _out, err = run_scan(root, db)
     assert status == 0, err
-    assert second['files']['up_to_date'] == stored
-    assert second['files']['scanned'] == second['scans']['primary_whole_file'] == count - stored
+    assert last['files']['up_to_date'] == stored
+    assert last['files']['scanned'] == last['scans']['primary_whole_file'] == count - stored
 
 
 # -- bad input ---------------------------------------------------------------------------

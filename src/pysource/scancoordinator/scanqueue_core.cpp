@@ -507,30 +507,10 @@ void AddReadyScanPairs(Q *q, const PairList &pairs, Borrowed scan_name, Borrowed
   Ref whole_files = q->f._fWholeFilesToCheck;
   const Borrowed wildcard = state->kWildcardScope;
 
-  // The pairs of a location usually come one after another: the record
-  // found or made for one pair serves the next pair of the same location
-  // object while the table is unchanged since.
-  Ref last_loc;
-  LocInfo last_info;
   pairs.for_each([&](PairRef lp) {
     Borrowed loc = lp.first, scope = lp.second;
     Ref key = make_key(q, scope, scan_name);
-    LocInfo info;
-    if (last_info && loc.get() == last_loc.get() && last_info.current(q)) {
-      info = std::move(last_info); // held once, as a fresh lookup's result would be
-    } else {
-      last_info = LocInfo();
-      info = loc_info(q, loc);
-    }
-    struct Keep {
-      Ref &last_loc;
-      LocInfo &last_info, &info;
-      Borrowed loc;
-      ~Keep() {
-        last_loc = loc.ref();
-        last_info = std::move(info);
-      }
-    } keep{last_loc, last_info, info, loc};
+    LocInfo info = loc_info(q, loc);
     // 1. already queued?  (The key's hash serves this lookup and the store.)
     Py_hash_t key_hash = -1;
     Ref existing;
@@ -611,12 +591,7 @@ void add_to_per_location_map(Q *q, Borrowed loc, Borrowed scan_name, Borrowed pr
     info.pending = py::new_dict();
     info.tuple =
         untrack_if_atomic(py::check(PyTuple_Pack(2, info.counts.get(), info.pending.get())));
-    Ref table = q->f._fPerLocationInfo;
-    py::dict_set(table, loc, info.tuple);
-    // The table's state in which `info` is the location's record, taken
-    // before LocationAdded, which may run Python code.
-    info.table = table.get();
-    info.version = py::dict_version(table);
+    py::dict_set(q->f._fPerLocationInfo, loc, info.tuple);
     call::LocationAdded(q, loc);
   }
   if (state->debug) {

@@ -553,65 +553,58 @@ def verify(workload, locs):
 
 # ---- timing -------------------------------------------------------------------------------
 
+def on_fresh_host(workload, locs, keep_gc, run, after=None):
+    """run(host) on a new Host with the workload queued, after a collection and with the
+    cyclic GC off while it runs unless keep_gc; then after(host), if given.  Returns what
+    run returned."""
+    host = Host(workload, locs)
+    try:
+        gc.collect()
+        if not keep_gc:
+            gc.disable()
+        try:
+            result = run(host)
+        finally:
+            gc.enable()
+        if after is not None:
+            after(host)
+    finally:
+        host.Close()
+    return result
+
+
 def run_once(workload, locs, args, keep_gc):
     """One timed drain and one timed floor run; returns the figures of this repetition."""
     n = units(workload, len(locs))
-    host = Host(workload, locs)
-    try:
-        gc.collect()
-        if not keep_gc:
-            gc.disable()
-        try:
-            seconds, slices, scan_late, return_late = drain(host)
-        finally:
-            gc.enable()
-        check_drained(host, workload, len(locs))
-    finally:
-        host.Close()
-    host = Host(workload, locs)
-    try:
-        gc.collect()
-        if not keep_gc:
-            gc.disable()
-        try:
-            floor_seconds = floor(host, workload, args, slices)
-        finally:
-            gc.enable()
-    finally:
-        host.Close()
+    seconds, slices, scan_late, return_late = on_fresh_host(
+        workload, locs, keep_gc, drain,
+        after=lambda host: check_drained(host, workload, len(locs)))
+    floor_seconds = on_fresh_host(workload, locs, keep_gc,
+                                  lambda host: floor(host, workload, args, slices))
     total, base = seconds / n * 1e6, floor_seconds / n * 1e6
     figures = {'total': total, 'floor': base, 'own': total - base, 'slices': len(slices),
                'scan_late_ms': scan_late * 1e3, 'return_late_ms': return_late * 1e3}
     if workload == 'secondary':
-        figures['queue'] = queue_alone(workload, locs, keep_gc) / n * 1e6
+        figures['queue'] = on_fresh_host(
+            workload, locs, keep_gc, queue_alone,
+            after=lambda host: check(host.fCoord._fScanQueue.Empty(),
+                                     'the queue drained by First/ScanCompleted')) / n * 1e6
     return figures
 
 
-def queue_alone(workload, locs, keep_gc):
+def queue_alone(host):
     """The queue's part of a secondary drain: First() and ScanCompleted(item) per scan, on
     the same queued state, called from a Python loop (so it includes two calls from
     Python per scan).  Returns the seconds taken."""
-    host = Host(workload, locs)
-    try:
-        queue = host.fCoord._fScanQueue
-        first, completed = queue.First, queue.ScanCompleted
-        gc.collect()
-        if not keep_gc:
-            gc.disable()
-        try:
-            t0 = _clock()
-            while True:
-                item = first()
-                if item.loc is None:
-                    break
-                completed(item)
-            seconds = _clock() - t0
-        finally:
-            gc.enable()
-        check(queue.Empty(), 'the queue drained by First/ScanCompleted')
-    finally:
-        host.Close()
-    return seconds
+    queue = host.fCoord._fScanQueue
+    first, completed = queue.First, queue.ScanCompleted
+    t0 = _clock()
+    while True:
+        item = first()
+        if item.loc is None:
+            break
+        completed(item)
+    return _clock() - t0
 
 
 def main(argv):
